@@ -1,0 +1,82 @@
+// Internal part of the utility layer: the operations the ACL library calls
+// besides the error records (locale-independent text, IPv6 text, counters,
+// codeset conversion handles) and the trace facility the library registers
+// with.  Not installed.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+
+// ---- Locale-independent text (POSIX locale case folding) ----------------
+
+// Compare with A-Z folded onto a-z; every other byte compares as an unsigned
+// value.  The same order serves insertion, search and evaluation.
+int zo_strcasecmp_posix_1(const char *a, const char *b);
+int zo_strncasecmp_posix_1(const char *a, const char *b, size_t n);
+int zo_tolower_posix_1(int c);
+
+// Canonical text of a 16-byte IPv6 address into `dst` (at least 65 bytes).
+// Equal addresses always give equal text.  Returns 0, or non-zero when dst
+// is too small.
+int zo_ipaddr_ntop_1(const unsigned char addr[16], char *dst, size_t dstlen);
+
+// ---- Counters and time ---------------------------------------------------
+
+struct zo_timeinfo {
+    uint64_t timeinfo1;
+    uint64_t timeinfo2;
+};
+
+// Fill the data that converts counter values to time.
+int zo_get_procspeed_1(zo_timeinfo *ti);
+// Read the 64-bit high-resolution counter.
+int zo_get_ctr_1(uint64_t *ctr);
+// Convert a counter value to seconds and nanoseconds.
+int zo_cvt_time_1(uint64_t ctr, const zo_timeinfo *ti, uint64_t *sec, uint64_t *nsec);
+
+// ---- Codeset conversion ---------------------------------------------------
+
+struct zo_iconv_s;
+typedef zo_iconv_s *zo_iconv_t;
+
+#define ZO_ICONV_FROM_UTF8 0x01u
+#define ZO_ICONV_UTF8_NOT_MODIFIED 0x08u
+#define ZO_ICONV_UTF8_BMP_ONLY 0x20u
+
+// Results of zo_iconv_str_1 besides 0.
+#define ZO_ICONV_RC_NO_MEMORY 15
+#define ZO_ICONV_RC_BAD_HANDLE 17
+#define ZO_ICONV_RC_BAD_ARGS 20
+#define ZO_ICONV_RC_INVALID 21
+
+int zo_utf8_is_assumed_1(void);
+int zo_utf8_is_not_modified_1(void);
+int zo_utf8_is_limited_to_bmp_1(void);
+// Open a conversion between `codeset` and UTF-8 in the direction flag 0x01
+// selects.  *handle stays null on failure.
+int zo_iconv_open_1(const char *codeset, uint32_t flags, zo_iconv_t *handle);
+// Convert the whole input (length with its NUL).  With *out null and *outlen
+// 0 the output is allocated (release with free).  Safe for concurrent
+// callers on one handle.
+int zo_iconv_str_1(zo_iconv_t handle, uint32_t options, const char *in, size_t *inlen,
+                   char **out, size_t *outlen);
+
+// ---- Trace facility -----------------------------------------------------
+
+typedef uint8_t tr_detail_level_t;
+
+struct tr_category_description_t {
+    uint32_t category_id;
+    const char *category_name;
+    uint32_t default_level_of_detail;
+    uint32_t minimum_level_of_detail;
+};
+
+int tr_register_component_1(const char *component, tr_detail_level_t *levels,
+                            const tr_category_description_t *categories, uint32_t count);
+int tr_record_id_1(const char *component, uint32_t id);
+// `count` items follow, each as (const void *address, size_t length).
+int tr_record_data_1(const char *component, uint32_t id, uint32_t count, ...);
+int tr_get_filename_1(char *name /* 257 bytes */);
+int tr_get_size_1(int32_t *size);
+int tr_unregister_component_1(const char *component);

@@ -1,0 +1,44 @@
+// The library's one allocation path (see ryacl_alloc.h).
+#include "ryacl_alloc.h"
+
+#include <atomic>
+#include <cstdlib>
+#include <cstring>
+
+namespace {
+std::atomic<acl__alloc_hook_t> g_hook{nullptr};
+
+bool allowed(size_t n) {
+    acl__alloc_hook_t h = g_hook.load(std::memory_order_acquire);
+    return !h || h(n);
+}
+}  // namespace
+
+void acl__set_alloc_hook(acl__alloc_hook_t hook) { g_hook.store(hook, std::memory_order_release); }
+
+void *acl__malloc(size_t n) {
+    if (!allowed(n)) return nullptr;
+    return std::malloc(n ? n : 1);
+}
+
+void *acl__calloc(size_t count, size_t size) {
+    if (size && count > SIZE_MAX / size) return nullptr;
+    if (!allowed(count * size)) return nullptr;
+    return std::calloc(count ? count : 1, size ? size : 1);
+}
+
+void *acl__realloc(void *p, size_t n) {
+    if (!allowed(n)) return nullptr;
+    return std::realloc(p, n ? n : 1);
+}
+
+char *acl__strndup(const char *s, size_t n) {
+    size_t len = strnlen(s, n);
+    char *d = static_cast<char *>(acl__malloc(len + 1));
+    if (!d) return nullptr;
+    std::memcpy(d, s, len);
+    d[len] = '\0';
+    return d;
+}
+
+char *acl__strdup(const char *s) { return acl__strndup(s, SIZE_MAX); }
