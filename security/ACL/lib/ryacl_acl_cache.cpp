@@ -1,0 +1,250 @@
+// The compiled ACL cache file NAME.cacl: written beside the ACL file through
+// an exclusively created temporary file that gets the ACL file's owner,
+// group and mode and is then renamed over the cache name, so a reader sees
+// the old or the new cache whole and never one with the wrong identity.
+#include <fcntl.h>
+#include <sys/random.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cinttypes>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+
+#include "ryacl_acl_file.h"
+#include "ryacl_error.h"
+#include "ryacl_trace.h"
+
+namespace tr = acl::trace;
+
+namespace {
+
+constexpr size_t kMaxPath = ACL_FNAME_AREA - 1;
+// Each failed exclusive creation appends four more digits; a handful of
+// collisions in a row means someone is planting names, not bad luck.
+constexpr int kMaxTmpAttempts = 8;
+
+// 16 bits for a temporary name.  The name need not be secret (exclusive
+// creation is what makes it safe), only hard to guess in advance; when the
+// kernel's source is unavailable or not yet seeded, a mix of clock, pid and
+// a counter still keeps concurrent writers apart.  Never blocks.
+uint16_t random16() {
+    uint16_t v = 0;
+    for (;;) {
+        ssize_t n = getrandom(&v, sizeof v, GRND_NONBLOCK);
+        if (n == static_cast<ssize_t>(sizeof v)) return v;
+        if (n < 0 && errno == EINTR) continue;
+        break;
+    }
+    static std::atomic<uint32_t> counter{0};
+    struct timespec ts {};
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    uint64_t x = static_cast<uint64_t>(ts.tv_nsec) ^ (static_cast<uint64_t>(ts.tv_sec) << 20) ^
+                 (static_cast<uint64_t>(getpid()) << 32) ^ counter.fetch_add(0x9e37u, std::memory_order_relaxed);
+    x ^= x >> 33;
+    x *= 0xff51afd7ed558ccdULL;
+    x ^= x >> 33;
+    return static_cast<uint16_t>(x);
+}
+
+struct cache_writer {
+    const char *aclfname;
+    const sec_acl_buffer_desc *acl;
+    char caclfname[ACL_FNAME_AREA];
+    char tmpname[ACL_FNAME_AREA];
+    struct stat acl_st {};
+    int cachefd = -1;  // existing cache, opened for writing, never written
+    int tmpfd = -1;
+    bool tmp_created = false;
+
+    int32_t check_existing(sec_boolean_t force);
+    int32_t create_tmp();
+    int32_t fill_tmp();
+    void cleanup(int32_t rc);
+};
+
+// Steps 5 to 10 of the store: look at an existing cache without following a
+// link, compare its identity, decide whether it is current.
+//
+// No placeholder is ever created at the cache name: a writer killed between
+// creating one and the rename would leave an empty mode-0 file that fails
+// every later owner/mode comparison.  The cache name comes into being only
+// through the final rename, so after a failure a cache that did not exist
+// still does not, with nothing to remove.  An existing cache is opened for
+// writing (no create, no truncate, never written) so that one the process
+// may not write is still refused with message 138 before anything is made;
+// the lock step is called on that descriptor, or on -1 when there is none.
+int32_t cache_writer::check_existing(sec_boolean_t force) {
+    struct stat cst {};
+    bool exists = false;
+
+    // O_PATH needs no permission on the file and has no side effect even on
+    // a device or FIFO; with O_NOFOLLOW a link gives a descriptor of the
+    // link itself.
+    acl__file_step("cache:open", caclfname);
+    int pfd = open(caclfname, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+    if (pfd < 0) {
+        int err = errno;
+        if (err != ENOENT) {
+            tr::point(tr::ERRORS, 109, {tr::str(caclfname), tr::str("stat()"), tr::val(err)});
+            return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+        }
+        tr::point(tr::INFO, 110, {tr::str(caclfname)});
+    } else {
+        int frc = fstat(pfd, &cst);
+        int err = errno;
+        close(pfd);
+        if (frc != 0) {
+            tr::point(tr::ERRORS, 109, {tr::str(caclfname), tr::str("stat()"), tr::val(err)});
+            return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+        }
+        // A link at the cache name is left alone: rename would replace it,
+        // but whoever planted it is up to something.
+        if (S_ISLNK(cst.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
+        exists = true;
+    }
+
+    if (exists) {
+        if (cst.st_uid != acl_st.st_uid || cst.st_gid != acl_st.st_gid) {
+            uint32_t cu = cst.st_uid, cg = cst.st_gid, au = acl_st.st_uid, ag = acl_st.st_gid;
+            tr::point(tr::ERRORS, 111, {tr::str(caclfname), tr::val(cu), tr::val(cg), tr::val(au), tr::val(ag)});
+            return acl::set_error(ACL_RC_FILE_ERROR, 136, aclfname);
+        }
+        if (cst.st_mode != acl_st.st_mode) {
+            uint32_t cm = cst.st_mode & 0xfffu, am = acl_st.st_mode & 0xfffu;
+            tr::point(tr::ERRORS, 111, {tr::str(caclfname), tr::val(cm), tr::val(am)});
+            return acl::set_error(ACL_RC_FILE_ERROR, 137, aclfname);
+        }
+        if (!force && acl_st.st_mtim.tv_sec < cst.st_mtim.tv_sec) return ACL_RC_INFO;
+
+        acl__file_step("cache:open-write", caclfname);
+        cachefd = open(caclfname, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+        struct stat wst {};
+        if (cachefd < 0 || fstat(cachefd, &wst) != 0 || wst.st_dev != cst.st_dev || wst.st_ino != cst.st_ino)
+            return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
+    }
+    return acl__lock_acl_file(caclfname, cachefd, 2);
+}
+
+// Exclusive creation without following links: a name planted in the
+// directory (file or link) is never opened, only skipped.
+int32_t cache_writer::create_tmp() {
+    size_t pos = std::strlen(aclfname);
+    std::memcpy(tmpname, aclfname, pos);
+    tmpname[pos++] = '.';
+    tmpname[pos] = '\0';
+    for (int attempt = 0; attempt < kMaxTmpAttempts && pos + 4 <= kMaxPath; ++attempt) {
+        std::snprintf(tmpname + pos, 5, "%04x", static_cast<unsigned>(random16()));
+        pos += 4;
+        acl__file_step("cache:open-tmp", tmpname);
+        tmpfd = open(tmpname, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0);
+        if (tmpfd >= 0) {
+            tmp_created = true;
+            return 0;
+        }
+        // Only a taken name is worth another try; anything else (no space,
+        // no permission, name too long) a longer name will not cure.
+        if (errno != EEXIST && errno != EINTR) break;
+    }
+    return acl::set_error(ACL_RC_FILE_ERROR, 138, tmpname);
+}
+
+// Write, then give the file its identity, then make it durable, all on the
+// descriptor: the file never appears under its final name with the wrong
+// owner or mode, and a crash after the rename finds it whole.
+int32_t cache_writer::fill_tmp() {
+    const char *data = static_cast<const char *>(acl->value);
+    size_t len = static_cast<size_t>(acl->length);
+    size_t done = 0;
+    int lerrno = 0;
+    while (done < len) {
+        acl__file_step("cache:write", tmpname);
+        ssize_t n = write(tmpfd, data + done, len - done);
+        if (n < 0) {
+            if (errno == EINTR) continue;
+            lerrno = errno;
+            break;
+        }
+        if (n == 0) break;  // no progress and no errno: give up, not spin
+        done += static_cast<size_t>(n);
+    }
+    if (done != len) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, lerrno);
+
+    acl__file_step("cache:fchown", tmpname);
+    if (fchown(tmpfd, acl_st.st_uid, acl_st.st_gid) != 0) {
+        char uidtext[24];
+        std::snprintf(uidtext, sizeof uidtext, "%ju", static_cast<uintmax_t>(acl_st.st_uid));
+        return acl::set_error(ACL_RC_FILE_ERROR, 141, caclfname, uidtext, acl_st.st_gid);
+    }
+    // After fchown, which may clear set-id bits.
+    acl__file_step("cache:fchmod", tmpname);
+    if (fchmod(tmpfd, acl_st.st_mode & 0xfffu) != 0)
+        return acl::set_error(ACL_RC_FILE_ERROR, 142, caclfname, acl_st.st_mode & 0xfffu);
+
+    // A failed fsync or close can mean the bytes never reached the disk:
+    // reported as a failed write with everything handed over.
+    acl__file_step("cache:fsync", tmpname);
+    if (fsync(tmpfd) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, errno);
+    acl__file_step("cache:close", tmpname);
+    int crc = close(tmpfd);
+    tmpfd = -1;
+    if (crc != 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, errno);
+
+    acl__file_step("cache:rename", tmpname);
+    if (rename(tmpname, caclfname) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 163, tmpname, caclfname);
+    tmp_created = false;
+    return 0;
+}
+
+// The first error stays the one reported: nothing here records another.
+void cache_writer::cleanup(int32_t rc) {
+    if (tmpfd >= 0) close(tmpfd);
+    if (rc != 0 && tmp_created) {
+        acl__file_step("cache:unlink", tmpname);
+        unlink(tmpname);
+    }
+    if (cachefd >= 0) close(cachefd);
+}
+
+}  // namespace
+
+int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *acl, sec_boolean_t force) {
+    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 1, 0);
+    // An absent descriptor holds no ACL, like an empty one.
+    if (!acl || acl->length == 0) {
+        if (tr::level(tr::INFO) == 1) tr::record_data(107, {tr::str(aclfname)});
+        return ACL_RC_INFO;
+    }
+    if (acl->length < 0 || !acl->value)
+        return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 2, acl);
+
+    size_t nlen = std::strlen(aclfname);
+    if (nlen > ACL_CACHE_MAX_ACLFNAME) {
+        uint32_t len32 = static_cast<uint32_t>(nlen);
+        tr::point(tr::ERRORS, 108, {tr::str(aclfname), tr::val(len32)});
+        return acl::set_error(ACL_RC_FILE_ERROR, 135, aclfname);
+    }
+
+    cache_writer w{};
+    w.aclfname = aclfname;
+    w.acl = acl;
+    std::memcpy(w.caclfname, aclfname, nlen);
+    std::memcpy(w.caclfname + nlen, ACL_CACHE_SUFFIX, sizeof ACL_CACHE_SUFFIX);
+
+    acl__file_step("cache:stat-acl", aclfname);
+    if (stat(aclfname, &w.acl_st) != 0) {
+        int err = errno;
+        tr::point(tr::ERRORS, 109, {tr::str(aclfname), tr::str("stat()"), tr::val(err)});
+        return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+    }
+
+    int32_t rc = w.check_existing(force);
+    if (rc == 0) rc = w.create_tmp();
+    if (rc == 0) rc = w.fill_tmp();
+    w.cleanup(rc);
+    return rc;
+}
