@@ -56,8 +56,9 @@ int zo_utf8_is_limited_to_bmp_1(void);
 // selects.  *handle stays null on failure.
 int zo_iconv_open_1(const char *codeset, uint32_t flags, zo_iconv_t *handle);
 // Convert the whole input (length with its NUL).  With *out null and *outlen
-// 0 the output is allocated (release with free).  Safe for concurrent
-// callers on one handle.
+// 0 the output is allocated (release with free); it is NUL-terminated
+// after *outlen bytes.  Safe for concurrent callers on one handle.  When it
+// returns ZO_ICONV_RC_NO_MEMORY, *outlen holds the size it could not get.
 int zo_iconv_str_1(zo_iconv_t handle, uint32_t options, const char *in, size_t *inlen,
                    char **out, size_t *outlen);
 
@@ -77,6 +78,12 @@ int tr_register_component_1(const char *component, tr_detail_level_t *levels,
 int tr_record_id_1(const char *component, uint32_t id);
 // `count` items follow, each as (const void *address, size_t length).
 int tr_record_data_1(const char *component, uint32_t id, uint32_t count, ...);
+// The same with the items in an array, for callers that hold a list.
+struct tr_item_t {
+    const void *addr;
+    size_t len;
+};
+int tr_record_datav_1(const char *component, uint32_t id, uint32_t count, const tr_item_t *items);
 int tr_get_filename_1(char *name /* 257 bytes */);
 int tr_get_size_1(int32_t *size);
 int tr_unregister_component_1(const char *component);

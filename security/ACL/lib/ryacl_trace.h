@@ -9,8 +9,12 @@
 
 #include "ry_zo_int.h"
 
+#include <pthread.h>
+
 extern "C" {
+extern tr_category_description_t acl__trace_categories[5];
 extern tr_detail_level_t acl__trace_detail_levels[5];
+extern pthread_once_t acl__trace_register_once;
 int32_t acl__trace_register_component(void);
 }
 
@@ -33,6 +37,9 @@ struct item {
 };
 // A text with its NUL; a null text is recorded as `absent` ("" by default).
 item str(const char *s, const char *absent = "");
+// A text read from an area of `max` bytes that need not hold a NUL: never
+// reads past the area.  Unterminated, it is recorded as raw bytes.
+item strn(const char *s, size_t max, const char *absent = "");
 template <class T>
 inline item val(const T &v) { return item{&v, sizeof v}; }
 
@@ -65,5 +72,9 @@ private:
     bool armed_ = false;
     uint64_t start_ = 0;
 };
+
+// Elapsed time between two (seconds, nanoseconds) readings; negative
+// nanoseconds borrow one second.
+void elapsed(uint64_t sec0, uint64_t nsec0, uint64_t sec1, uint64_t nsec1, int64_t *sec, int64_t *nsec);
 
 }  // namespace acl::trace
