@@ -20,7 +20,7 @@
 
 namespace {
 
-void report() { acl::report_current_error(stderr, true); }
+void print_error() { acl::report_current_error(stderr, true); }
 
 // Open the vetted file and make sure the descriptor still refers to it.
 // O_NONBLOCK keeps a FIFO swapped in after the vetting from hanging the
@@ -73,18 +73,18 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
     struct stat vetted;
     int32_t rc = aclfck__get_aclfile(aclfname, username, name, &vetted);
     if (rc != 0) {
-        report();
+        print_error();
         return rc;
     }
 
     int fd;
     if ((rc = open_vetted(name, vetted, &fd)) != 0) {
-        report();
+        print_error();
         return rc;
     }
     if ((rc = acl__lock_acl_file(name, fd, 1)) != 0) {
         close(fd);
-        report();
+        print_error();
         return rc;
     }
     char *text = nullptr;
@@ -92,13 +92,13 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
     rc = acl__read_acl_file(name, fd, &text, &size);
     close(fd);
     if (rc != 0) {
-        report();
+        print_error();
         return rc;
     }
     if (size == 0) {
         if (flags & ACLFCK_VERBOSE) {
             acl::set_error(ACL_RC_INFO, 157, name);
-            report();
+            print_error();
         }
         std::free(text);
         return 0;
@@ -117,7 +117,7 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
         rc = sec__read_acle_from_text(&acl__default_perm_set, &cursor, &left, &lineno, &acle);
         if (rc == 0) break;
         if (rc != 1) {
-            report();
+            print_error();
             // A memory failure is never a fault of the file: it ends the
             // check even under -c.
             if ((flags & ACLFCK_CONTINUE) && rc != ACL_RC_NO_MEMORY) {
@@ -132,7 +132,7 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
         if (flags & ACLFCK_VERBOSE) sec__dump_acle(&acle, nullptr, "");
         rc = sec__add_acle_to_trees(&acle, &trees);
         if (rc == 0) continue;
-        report();
+        print_error();
         if (rc == ACL_RC_BAD_ACLE && (flags & ACLFCK_CONTINUE)) {
             clean = false;
             continue;
@@ -145,11 +145,11 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
     if (stopped) {
         if (flags & ACLFCK_CACHE) {
             acl::set_error(ACL_RC_INFO, 162);
-            report();
+            print_error();
         }
     } else if ((flags & ACLFCK_CACHE) && !clean) {
         acl::set_error(ACL_RC_INFO, 162);
-        report();
+        print_error();
     } else if (flags & ACLFCK_CACHE) {
         sec_acl_buffer_desc compiled{0, nullptr};
         rc = sec__acltrees_to_acl(&trees, &compiled);
@@ -157,7 +157,7 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
         // 1 means there was nothing to store and records nothing; a compiled
         // ACL is never empty, so it cannot arise here, and it is no failure.
         if (rc != 0 && rc != ACL_RC_INFO) {
-            report();
+            print_error();
             result = rc;
         }
         std::free(compiled.value);
