@@ -3,6 +3,7 @@
 
 #include <pthread.h>
 
+#include <atomic>
 #include <cstdint>
 
 #include "ryacl.h"
@@ -13,8 +14,31 @@ struct acl__id_handler_s {
     sec_acl_id_handler handler;
 };
 
+// Registrations are only ever appended, so lookups never take the mutex:
+// `count` and `id_handlers` are published with release stores after the
+// slots they cover are written, and a reader that loads the count first
+// always finds at least that many valid slots behind the pointer it loads
+// next.  A full block is replaced by a copy twice its size; old blocks are
+// never freed (a reader may still walk one) and stay reachable through the
+// block header, so the registry costs memory linear in its registrations.
+struct acl__state_s {
+    pthread_mutex_t mutex;
+    std::atomic<int32_t> count;                    // registrations published
+    std::atomic<acl__id_handler_s *> id_handlers;  // current block's slots
+    int32_t capacity;                              // slots of the current block; under mutex
+};
+typedef acl__state_s acl__state_desc;
+
+extern acl__state_desc acl__state;
+extern pthread_once_t acl__init_once_block;
+
+// Zero the state and initialise its mutex; run once through
+// acl__init_once_block.
+extern "C" void acl__state_init(void);
+
 // Run acl__state_init once per process.
 void acl__state_ensure_init();
 
 // First handler registered for type and mech (case-insensitive), or null.
+// Takes no lock; always 0.
 int32_t sec__get_id_handler(uint32_t type, const char *mech, sec_acl_id_handler *handler);

@@ -1,0 +1,161 @@
+// Listing a compiled ACL as entry records, whole or by type.
+//
+// The buffer may not have been validated: each sub-ACL visited must cover
+// its header and end inside the block (97 otherwise), and it is read back
+// within its own length.  Sub-ACLs are visited in a loop and each is read
+// through a tree that never recurses, so no input makes the stack deep.
+#include <cstdlib>
+#include <cstring>
+
+#include "ryacl_acl_buffer.h"
+#include "ryacl_acl_entry.h"
+#include "ryacl_acl_tree.h"
+#include "ryacl_error.h"
+#include "ryacl_trace.h"
+
+namespace {
+
+using acl::trace::str;
+using acl::trace::val;
+
+// Descriptor checks of both listings: an empty descriptor is fine (nothing
+// to list); a length and a block that disagree, or a header that is not
+// there, are not.  true with *empty set when there is nothing to read.
+int32_t check_acl(const sec_acl_buffer_desc *acl, bool *empty) {
+    *empty = false;
+    if (acl->length == 0 && !acl->value) {
+        *empty = true;
+        return 0;
+    }
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length < ACL_HDR_SIZE)
+        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+    const auto *p = static_cast<const unsigned char *>(acl->value);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    return 0;
+}
+
+// Length of the sub-ACL at `off`, or 0 (97 recorded) when it does not lie
+// inside the block.
+size_t subacl_length(const sec_acl_buffer_desc *acl, size_t off) {
+    const auto *p = static_cast<const unsigned char *>(acl->value);
+    const size_t total = static_cast<size_t>(acl->length);
+    if (off > total || total - off < ACL_SUBACL_HDR_SIZE) {
+        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        return 0;
+    }
+    const size_t len = acl__load_le32(p + off);
+    if (len > total - off || len < ACL_SUBACL_HDR_SIZE + size_t{p[off + 9]}) {
+        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        return 0;
+    }
+    return len;
+}
+
+int32_t expand(const sec_acl_buffer_desc *acl, size_t off, size_t len, sec_acle_list_t list) {
+    sec_acltree_t tree = nullptr;
+    int32_t rc =
+        sec__subacl_to_acltree(static_cast<const unsigned char *>(acl->value) + off, len, &tree);
+    if (!rc) rc = sec__acltree_to_aclelist(tree, list);
+    sec__free_acltree(tree);
+    return rc;
+}
+
+// Expand every sub-ACL (type 0) or every one of `type`, in buffer order.
+int32_t expand_all(const sec_acl_buffer_desc *acl, unsigned type, sec_acle_list_t list) {
+    const auto *p = static_cast<const unsigned char *>(acl->value);
+    const unsigned nsub = acl__load_le16(p + 3);
+    size_t off = ACL_HDR_SIZE;
+    for (unsigned s = 0; s < nsub; ++s) {
+        const size_t len = subacl_length(acl, off);
+        if (!len) return ACL_RC_BAD_ACL;
+        if (type == 0 || p[off + 4] == type) {
+            if (int32_t rc = expand(acl, off, len, list)) return rc;
+        }
+        off += len;
+    }
+    return 0;
+}
+
+// A list that was being filled is emptied by a failure; a list refused
+// before that is left as the caller gave it.
+int32_t released_on_failure(int32_t rc, sec_acle_list_t list) {
+    if (rc) sec_release_aclelist(list);
+    return rc;
+}
+
+int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 1, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 2, 0);
+    bool empty = false;
+    if (int32_t rc = check_acl(acl, &empty)) return rc;
+    list->count = 0;
+    list->acles = nullptr;
+    if (empty) return 0;
+    return released_on_failure(expand_all(acl, 0, list), list);
+}
+
+int32_t list_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
+                     sec_acle_list_t list) {
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 1, 0);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 2, type);
+    const bool has_mech = acl__type_has_mech(type);
+    if (has_mech && mech) {
+        const size_t mlen = strnlen(mech, 17);
+        if (mlen == 0 || mlen > 16)
+            return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 3,
+                                  static_cast<const void *>(mech));
+    }
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 4, 0);
+    bool empty = false;
+    if (int32_t rc = check_acl(acl, &empty)) return rc;
+    list->count = 0;
+    list->acles = nullptr;
+    if (empty) return 0;
+    if (has_mech && !mech) return released_on_failure(expand_all(acl, type, list), list);
+
+    unsigned char *sub = nullptr;
+    sec__find_subacl(acl, type, has_mech ? mech : nullptr, &sub);
+    if (!sub) return 0;
+    const size_t off = static_cast<size_t>(sub - static_cast<unsigned char *>(acl->value));
+    const size_t len = subacl_length(acl, off);
+    if (!len) return ACL_RC_BAD_ACL;
+    return released_on_failure(expand(acl, off, len, list), list);
+}
+
+}  // namespace
+
+int32_t sec_list_acl(sec_acl_buffer_t acl, sec_acle_list_t aclelist) {
+    if (acl)
+        acl::trace::api_entry(20, 24, {val(acl->length), val(acl->value), val(aclelist)});
+    else
+        acl::trace::api_entry(20, 22, {val(acl), val(aclelist)});
+    acl::clear_error();
+    int32_t rc = list_acl(acl, aclelist);
+    acl::trace::api_exit(25, 26, 27, rc, {val(rc ? 0 : aclelist->count)});
+    return rc;
+}
+
+int32_t sec_list_acl_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
+                             sec_acle_list_t aclelist) {
+    if (acl)
+        acl::trace::api_entry(28, 32,
+                              {val(acl->length), val(acl->value), val(type), str(mech), val(aclelist)});
+    else
+        acl::trace::api_entry(28, 30, {val(acl), val(type), str(mech), val(aclelist)});
+    acl::clear_error();
+    int32_t rc = list_by_type(acl, type, mech, aclelist);
+    acl::trace::api_exit(33, 34, 35, rc, {val(rc ? 0 : aclelist->count)});
+    return rc;
+}
+
+void sec_release_aclelist(sec_acle_list_t aclelist) {
+    acl::trace::api_entry(36, 38, {val(aclelist), val(aclelist ? aclelist->count : 0)});
+    if (aclelist && aclelist->count != 0 && aclelist->acles) {
+        for (int32_t i = 0; i < aclelist->count; ++i) sec_release_acle(aclelist->acles[i]);
+        std::free(aclelist->acles);
+        aclelist->acles = nullptr;
+        aclelist->count = 0;
+    }
+    acl::trace::api_release_exit(39);
+}
