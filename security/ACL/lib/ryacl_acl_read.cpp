@@ -17,6 +17,7 @@
 #include <cstring>
 
 #include "ryacl_acl_buffer.h"
+#include "ryacl_acl_check.h"
 #include "ryacl_acl_entry.h"
 #include "ryacl_acl_file.h"
 #include "ryacl_acl_tree.h"
@@ -127,7 +128,11 @@ bool reader::take_cache() {
     }
     sec_buffer_desc desc{static_cast<int32_t>(aclfsize), aclfbuf};
     if (flags & SEC_ACLF_CONVERT_CACHE) {
+        // Conversion validates only what is already in host order; what it
+        // reversed is validated after it.
+        const bool foreign = aclfsize > 2 && static_cast<unsigned char>(aclfbuf[2]) != 2;
         rc = sec_convert_acl_to_host(1, &desc);
+        if (!rc && foreign) rc = sec__check_acl_buffer(&desc);
         if (rc) {
             fall_back(rc);
             return false;
