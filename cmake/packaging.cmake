@@ -7,6 +7,7 @@ install(FILES
   ${CMAKE_SOURCE_DIR}/docs/getting-started.md
   ${CMAKE_SOURCE_DIR}/docs/api.md
   ${CMAKE_SOURCE_DIR}/docs/l10n.md
+  ${CMAKE_SOURCE_DIR}/docs/tracing.md
   DESTINATION ${CMAKE_INSTALL_DOCDIR}
   OPTIONAL)
 

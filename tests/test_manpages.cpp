@@ -105,7 +105,7 @@ TEST_F(ManPages, QueryPageDocumentsEveryOptionOfItsHelp) {
     auto help = rytest::run({RYACLQ_PATH, "--help"});
     ASSERT_EQ(help.status, 0);
     std::string text = render(groff_, "ryaclq.1");
-    std::regex opt("^  (-[a-zA-Z]), (--[a-z-]+)");
+    std::regex opt("^  (-[a-zA-Z]), (--[a-z-]+)", std::regex::multiline);
     int seen = 0;
     for (std::sregex_iterator it(help.out.begin(), help.out.end(), opt), end; it != end; ++it, ++seen) {
         std::string item = "^ +" + (*it)[1].str() + ", " + (*it)[2].str() + "\\b";

@@ -62,11 +62,21 @@ void expect_refusal(const rytest::run_result &r, int status, const char *id) {
     EXPECT_NE(r.err.find(id), std::string::npos) << r.err;
 }
 
+void set_mtime_at(const std::string &path, time_t when) {
+    struct timeval tv[2] = {{when, 0}, {when, 0}};
+    ASSERT_EQ(utimes(path.c_str(), tv), 0);
+}
+
 void set_mtime(const std::string &path, long seconds_from_now) {
     struct timeval now;
     gettimeofday(&now, nullptr);
-    struct timeval tv[2] = {{now.tv_sec + seconds_from_now, 0}, {now.tv_sec + seconds_from_now, 0}};
-    ASSERT_EQ(utimes(path.c_str(), tv), 0);
+    set_mtime_at(path, now.tv_sec + seconds_from_now);
+}
+
+time_t mtime_of(const std::string &path) {
+    struct stat st;
+    EXPECT_EQ(stat(path.c_str(), &st), 0);
+    return st.st_mtime;
 }
 
 class Ryaclq : public ::testing::Test {
@@ -234,10 +244,10 @@ TEST_F(Ryaclq, StaleOrMismatchedCacheNeverAnswers) {
     const std::string cache = file_ + ".cacl";
 
     rytest::write_file(cache, bytes, 0640);
-    set_mtime(cache, -200);  // older than the text
+    set_mtime_at(cache, mtime_of(file_) - 1);  // older than the text
     expect_answer(q({"-o", file_}), grant("rl"));
 
-    set_mtime(cache, -100);  // the same second as the text: still stale
+    set_mtime_at(cache, mtime_of(file_));  // the same second: still stale
     expect_answer(q({"-o", file_}), grant("rl"));
 
     rytest::write_file(cache, bytes, 0600);  // current, but another mode

@@ -167,9 +167,8 @@ int parse_options(int argc, char **argv, options &o) {
         {"version", no_argument, nullptr, 'V'},
         {nullptr, 0, nullptr, 0},
     };
-    // "+": stop at the first non-option, so a file named "-x" can follow "--".
     int c;
-    while ((c = getopt_long(argc, argv, "+noi:e:g:lu:twCvhV", kLong, nullptr)) != -1) {
+    while ((c = getopt_long(argc, argv, "noi:e:g:lu:twCvhV", kLong, nullptr)) != -1) {
         query q = query::none;
         switch (c) {
         case 'n': q = query::unauthenticated; break;
