@@ -1,0 +1,121 @@
+// The ACL text parser: outcomes line by line, limits, messages, and the
+// cursor protocol under random input.
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "ryacl_acl_entry.h"
+#include "ryacl_test_support.h"
+
+using namespace std::string_literals;
+
+namespace {
+
+// The current error as "E<message>" and its arguments: "@<int>", "(<text>)".
+std::string error_word(int32_t rc) {
+    zo_error_t *rec = nullptr;
+    zo_get_error_1(&rec);
+    if (!rec) return "E-none";
+    std::string w = "E" + std::to_string(rec->zo_msg_num);
+    for (uint32_t k = 0; k < rec->zo_arg_cnt; ++k) {
+        const zo_error_arg_value_t &v = rec->zo_args[k].zo_arg_value;
+        w += rec->zo_args[k].zo_arg_type == ZO_ERROR_ARG_CHAR_STR ? "("s + v.zo_arg_char_str + ")"
+                                                                   : "@" + std::to_string(v.zo_arg_int);
+    }
+    EXPECT_EQ(rc, rec->zo_msg_num == 145 ? 37 : rec->zo_msg_num == 166 ? 36 : 42) << w;
+    zo_rel_error_1(rec);
+    return w;
+}
+
+// Parse a whole text into one word per line (".", "u:unix:alice:3",
+// "E158@2"), checking the cursor protocol after every call.
+std::vector<std::string> words_of(const std::string &text) {
+    std::vector<char> buf(text.begin(), text.end());
+    buf.push_back('\0');
+    char *cur = buf.data(), *const end = buf.data() + buf.size();
+    size_t len = buf.size();
+    int32_t line = 1, rc;
+    std::vector<std::string> words;
+    sec_acle_desc e;
+    for (char *before = cur; (rc = sec__read_acle_from_text(nullptr, &cur, &len, &line, &e)) != 0; before = cur) {
+        EXPECT_EQ(line, static_cast<int32_t>(words.size()) + 2);
+        EXPECT_TRUE(cur ? cur > before && len == static_cast<size_t>(end - cur) : len == 0);
+        std::string w = rc != 1 ? error_word(rc) : e.type ? std::string(1, acl__type_letter(e.type)) : ".";
+        if (rc == 1 && e.type) {
+            if (e.mech[0]) w += ":"s + e.mech;
+            if (e.id) w += ":"s + (e.id >= buf.data() && e.id < end ? e.id : "OUTSIDE");
+            char hex[16];
+            std::snprintf(hex, sizeof hex, ":%x", e.perm);
+            w += hex;
+        }
+        words.push_back(w);
+        if (words.size() > buf.size()) {
+            ADD_FAILURE() << "the parser never reaches the end";
+            break;
+        }
+    }
+    EXPECT_TRUE(e.type == 0 && line == static_cast<int32_t>(words.size()) + 1);
+    return words;
+}
+
+std::string parse_all(const std::string &text) {
+    std::string s;
+    for (const std::string &w : words_of(text)) s += (s.empty() ? "" : " ") + w;
+    return s;
+}
+
+TEST(AclParse, LineOutcomesLimitsAndMessages) {
+    const std::string x1094(1094, 'x'), a1093(1093, 'a');
+    const struct { std::string text, expect; } cases[] = {
+        {"", ""},
+        {"\n# c\n \t\v\n", ". . ."},
+        {"N\no # comment\ng staff\nu unix alice\n", "n:0 o:0 g:staff:0 u:unix:alice:0"},
+        {"G\nu unix\ne hba2 # alice\ng\t\n", "E158@1 E158@2 E158@3 E158@4"},
+        // 166 replaces the template lookup's 133.
+        {"n rw x\nn rw #x\nn rw#x\nn unix rw\n", "E159@1 n:3 E166@3(rw#x) E166@4(unix)"},
+        {"g staff rw x\nu unix alice r w\ne k id #\nnn rw\nx\n", "E159@1 E159@2 e:k:id:0 E165@4(nn) E165@5(x)"},
+        {"U UNIX Alice r\ne abcdefghijklmnop id\ne abcdefghijklmnopq id\n",
+         "u:unix:Alice:1 e:abcdefghijklmnop:id:0 E132(abcdefghijklmnopq)@3"},
+        {"n r\r\ng staff\r\nx\r\n", "n:1 . g:staff:0 . E165@5(x) ."},
+        {"u unix\falice r\ng staff\rrw\n", "E158@1 E165@2(alice) g:staff:0 E165@4(rw)"},
+        {"u\tunix\valice\trl  \t# c", "u:unix:alice:41"},
+        {"n r\n\0g x\n"s, "n:1 E131@2"},
+        {"g st\0aff\nn\n"s, "E131@1"},
+        {"x r\0\n"s, "E165@1(x)"},
+        {"\0"s, "E131@1"},
+        // 1095 characters pass and 1096 fail, a final NUL counting as the terminator.
+        {"#" + x1094 + "\n#" + x1094, ". ."},
+        {"g " + a1093, "g:" + a1093 + ":0"},
+        {"#x" + x1094 + "\nn r", "E145@1 n:1"},
+        {"g a" + a1093, "E145@1"},
+        {"x " + x1094 + x1094 + "\n", "E145@1"},
+    };
+    for (const auto &c : cases) EXPECT_EQ(parse_all(c.text), c.expect) << c.text;
+}
+
+// Texts built from pieces of the grammar and random bytes: every call
+// consumes exactly one line, and nothing after a stray NUL is parsed.
+TEST(AclParse, RandomTextsKeepTheCursorProtocol) {
+    const std::vector<std::string> pieces = {
+        "n", "o", "u", "e", "g", "N", "x", "nn", "unix", "UNIX", "alice@node1", "rw", "z", "r#x",
+        " ", "\t", "\v", " ", "#", "\n", "\r", "\f", "\r\n", "\0"s, std::string(17, 'm'), std::string(1093, 'q')};
+    std::mt19937 rng(20240611);
+    for (int round = 0; round < 3000; ++round) {
+        std::string text;
+        for (unsigned i = rng() % 12; i > 0; --i)
+            text += rng() % 4 ? pieces[rng() % pieces.size()] : std::string(1, static_cast<char>(rng()));
+        const size_t nul = text.find('\0');
+        size_t lines = 0, tail = 0;
+        for (char c : text.substr(0, nul)) tail = c == '\n' || c == '\f' || c == '\r' ? (++lines, 0) : tail + 1;
+        lines += tail || nul != std::string::npos;
+
+        std::vector<std::string> words = words_of(text);
+        ASSERT_EQ(words.size(), lines) << testing::PrintToString(text);
+        EXPECT_TRUE(nul == std::string::npos || words.back()[0] == 'E') << testing::PrintToString(text);
+    }
+}
+
+}  // namespace
