@@ -56,6 +56,10 @@ TEST(AclCreate, ParameterChecksInOrder) {
         EXPECT_TRUE(error_has(88, "parameter number: " + std::to_string(b.pos)) && !e) << b.pos;
     }
     EXPECT_TRUE(error_has(88, "sec_create_acle\n\tPositional parameter number: 1\n\tParameter value: 0x20\n"));
+    // Untranslated mechanisms (as from a compiled ACL) must fit the field too.
+    sec_acle_t e = nullptr;
+    EXPECT_EQ(sec__create_acle(8, 0, "abcdefghijklmnopq", "id", 0, &e), ACL_RC_BAD_ARGS);
+    EXPECT_TRUE(error_has(88, "sec__create_acle\n\tPositional parameter number: 3") && !e);
 }
 
 // Create, display and release an entry; *out gets "mech|id", "-" for an

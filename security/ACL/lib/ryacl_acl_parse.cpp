@@ -1,6 +1,6 @@
 // The ACL text parser: one line per call, in place, no allocation.
 #include <cctype>
-#include <climits>
+#include <cstdint>
 #include <cstring>
 
 #include "ry_zo_int.h"
@@ -69,8 +69,8 @@ struct line_parser {
         bool ends_line;
     };
 
-    // A line end may be the position of a NUL written over a token's end, so
-    // only bytes not yet written over are looked at here.
+    // Called before a token's end is overwritten, so `last` sees the byte
+    // that was there.
     void note_end(unsigned char *at) {
         end = at;
         last = *at == '\0';
