@@ -61,10 +61,12 @@ inline bytes worked_example() {
 }
 
 // A heap copy in a descriptor, sized exactly, so a sanitizer sees any read
-// past the end.  Release with sec_release_acl or free.
+// past the end; no bytes give the empty descriptor.  Release with
+// sec_release_acl or free.
 inline sec_buffer_desc own(const bytes &b) {
-    sec_buffer_desc d{static_cast<int32_t>(b.size()), std::malloc(b.empty() ? 1 : b.size())};
-    if (!b.empty()) std::memcpy(d.value, b.data(), b.size());
+    if (b.empty()) return sec_buffer_desc{0, nullptr};
+    sec_buffer_desc d{static_cast<int32_t>(b.size()), std::malloc(b.size())};
+    std::memcpy(d.value, b.data(), b.size());
     return d;
 }
 inline bytes view(const sec_buffer_desc &d) {

@@ -68,11 +68,11 @@ TEST(Add, NewSubaclIsAppendedAndAGrownOneKeepsItsPlace) {
     EXPECT_EQ(view(d), make_acl({subacl(4, "unix", {{3, "Alice"}, {1, "bob"}}),
                                  subacl(2, "", {{1, ""}}), subacl(16, "", {{2, "staff"}})}));
     ASSERT_EQ(add(d, 4, 9, "unix", "al"), 0);
-    EXPECT_EQ(view(d), make_acl({subacl(4, "unix", {{3, "Alice"}, {9, "al"}, {1, "bob"}}),
+    EXPECT_EQ(view(d), make_acl({subacl(4, "unix", {{9, "al"}, {3, "Alice"}, {1, "bob"}}),
                                  subacl(2, "", {{1, ""}}), subacl(16, "", {{2, "staff"}})}));
     ASSERT_EQ(add(d, 8, 1, "krb", "z"), 0);
     ASSERT_EQ(add(d, 8, 2, "krb", "a"), 0);  // expanded entries keep insertion order
-    EXPECT_EQ(view(d), make_acl({subacl(4, "unix", {{3, "Alice"}, {9, "al"}, {1, "bob"}}),
+    EXPECT_EQ(view(d), make_acl({subacl(4, "unix", {{9, "al"}, {3, "Alice"}, {1, "bob"}}),
                                  subacl(2, "", {{1, ""}}), subacl(16, "", {{2, "staff"}}),
                                  subacl(8, "krb", {{1, "z"}, {2, "a"}})}));
     drop(d);

@@ -345,7 +345,9 @@ void trace_entry(uint32_t id, uint32_t data_id, const sec_acle_desc *acle, const
     acl::trace::api_entry(
         id, data_id,
         {val(acle), val(acle ? acle->type : 0), val(acle ? acle->perm : 0u),
-         strn(acle ? acle->mech : nullptr, sizeof acle->mech), str(acle ? acle->id : nullptr),
+         strn(acle ? acle->mech : nullptr, sizeof acle->mech),
+         // Types without an identifier may carry any pointer there.
+         str(acle && acl__type_has_id(acle->type) ? acle->id : nullptr),
          val(acl), val(acl ? acl->length : 0), val(acl ? acl->value : nullptr)});
 }
 

@@ -192,28 +192,34 @@ int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uin
 
 int32_t sec__single_acle_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech,
                               const char *zmech, const char *id, uint32_t *perm) {
-    acl::trace::api_entry(79, 81,
-                          {val(acl), val(acl ? acl->length : 0), val(acl ? acl->value : nullptr),
-                           val(type), str(mech), str(id), val(perm)});
+    // The items are only built when the point is on: an evaluation is
+    // called per request and must not pay for texts it never records.
+    const bool api = acl::trace::level(acl::trace::API) != 0;
+    if (api)
+        acl::trace::api_entry(79, 81,
+                              {val(acl), val(acl ? acl->length : 0), val(acl ? acl->value : nullptr),
+                               val(type), str(mech), str(id), val(perm)});
     acl::trace::perf_timer timer(2);
     acl::clear_error();
     acl__state_ensure_init();
     int32_t rc = single_perm(acl, type, mech, zmech, id, perm);
     if (timer.armed()) timer.record(7, {val(type), str(mech), str(id)});
-    acl::trace::api_exit(82, 83, 84, rc, {val(rc ? 0u : *perm)});
+    if (api) acl::trace::api_exit(82, 83, 84, rc, {val(rc ? 0u : *perm)});
     return rc;
 }
 
 int32_t sec__group_acles_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups,
                               uint32_t *perm) {
-    acl::trace::api_entry(85, 87,
-                          {val(acl), val(acl ? acl->length : 0), val(acl ? acl->value : nullptr),
-                           val(count), val(groups), val(perm)});
+    const bool api = acl::trace::level(acl::trace::API) != 0;
+    if (api)
+        acl::trace::api_entry(85, 87,
+                              {val(acl), val(acl ? acl->length : 0), val(acl ? acl->value : nullptr),
+                               val(count), val(groups), val(perm)});
     acl::trace::perf_timer timer(2);
     acl::clear_error();
     acl__state_ensure_init();
     int32_t rc = group_perm(acl, count, groups, perm);
     if (timer.armed()) timer.record(8, {val(count)});
-    acl::trace::api_exit(88, 89, 90, rc, {val(rc ? 0u : *perm)});
+    if (api) acl::trace::api_exit(88, 89, 90, rc, {val(rc ? 0u : *perm)});
     return rc;
 }

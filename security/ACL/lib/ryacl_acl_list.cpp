@@ -80,7 +80,14 @@ int32_t expand_all(const sec_acl_buffer_desc *acl, unsigned type, sec_acle_list_
 // A list that was being filled is emptied by a failure; a list refused
 // before that is left as the caller gave it.
 int32_t released_on_failure(int32_t rc, sec_acle_list_t list) {
-    if (rc) sec_release_aclelist(list);
+    if (rc) {
+        sec_release_aclelist(list);
+        // A failure may leave an array grown for entries never moved in:
+        // the count is still 0, so the release above does not see it.
+        std::free(list->acles);
+        list->acles = nullptr;
+        list->count = 0;
+    }
     return rc;
 }
 
