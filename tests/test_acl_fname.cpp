@@ -1,0 +1,97 @@
+// ACL file name resolution: relative, absolute and per-user names within the
+// 4097-byte area, unknown users, allocation failure.
+#include <gtest/gtest.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <string>
+
+#include "ryacl_acl_file.h"
+#include "ryacl_test_support.h"
+
+namespace {
+
+// Resolves into an area followed by guard bytes that must survive every call.
+struct resolver {
+    char b[ACL_FNAME_AREA + 64];
+    uid_t uid = 4242;
+    int32_t operator()(const std::string &f, const char *user) {
+        std::memset(b, 0x5a, sizeof b);
+        int32_t rc = sec__get_aclfname(f.c_str(), user, b, &uid);
+        for (size_t i = ACL_FNAME_AREA; i < sizeof b; ++i) EXPECT_EQ(b[i], 0x5a) << "overrun at " << i;
+        return rc;
+    }
+    void fails(const std::string &f, const char *user, int32_t rc, int32_t msg) {
+        EXPECT_EQ((*this)(f, user), rc) << f.substr(0, 20);
+        EXPECT_EQ(rytest::error_msgnum(), msg);
+    }
+};
+
+std::string cwd() {
+    char b[ACL_FNAME_AREA];
+    return getcwd(b, sizeof b) ? b : "";
+}
+
+TEST(AclFname, NamesWithoutUserAndTheAreaLimit) {
+    rytest::tmp_dir d;
+    std::string old = cwd();
+    ASSERT_EQ(chdir(d.path().c_str()), 0);
+    std::string here = cwd();
+    resolver r;
+    EXPECT_EQ(r("acl", nullptr), 0);
+    EXPECT_EQ(r.b, here + "/acl");
+    EXPECT_EQ(r("../acl", nullptr), 0);
+    EXPECT_EQ(r.b, here + "/../acl");
+    size_t fit = 4096 - 1 - here.size();  // directory, separator, name: 4096
+    EXPECT_EQ(r(std::string(fit, 'n'), nullptr), 0);
+    EXPECT_EQ(std::strlen(r.b), 4096u);
+    r.fails(std::string(fit + 1, 'n'), nullptr, 105, 153);
+    std::string abs = "/x//./" + std::string(4090, 'x');
+    EXPECT_EQ(r(abs, nullptr), 0);
+    EXPECT_EQ(r.b, abs);
+    r.fails(abs + "x", nullptr, 105, 153);
+    ASSERT_EQ(chdir("/"), 0);
+    EXPECT_EQ(r("acl", nullptr), 0);
+    EXPECT_STREQ(r.b, "/acl");
+    EXPECT_EQ(r.uid, 4242u);  // written only with a user
+    ASSERT_EQ(chdir(old.c_str()), 0);
+}
+
+TEST(AclFname, SimpleNameInTheUsersHome) {
+    struct passwd *pw = getpwuid(geteuid());
+    ASSERT_NE(pw, nullptr);
+    std::string user = pw->pw_name, home = pw->pw_dir;
+    uid_t want = pw->pw_uid;
+    resolver r;
+    EXPECT_EQ(r("acl", user.c_str()), 0);
+    EXPECT_EQ(r.b, home + (home.back() == '/' ? "" : "/") + "acl");
+    EXPECT_EQ(r.uid, want);
+
+    size_t fit = 4096 - 1 - home.size();  // counted with the separator
+    EXPECT_EQ(r(std::string(fit, 'n'), user.c_str()), 0);
+    r.uid = 4242;
+    r.fails(std::string(fit + 1, 'n'), user.c_str(), 4, 151);
+    for (const char *bad : {"d/acl", "/etc/acl", "../acl", "acl/"}) r.fails(bad, user.c_str(), 4, 151);
+    for (const char *nobody : {"", "no-such-user-ryacl"}) {
+        r.fails("acl", nobody, 15, 127);
+        EXPECT_NE(rytest::error_text().find("(" + std::string(nobody) + ")"), std::string::npos);
+    }
+    EXPECT_EQ(r.uid, 4242u);  // no failure touched it
+}
+
+TEST(AclFname, UserLookupAllocationFailure) {
+    std::string user = getpwuid(geteuid())->pw_name;
+    char home[ACL_FNAME_AREA];
+    uid_t uid = 0;
+    long sites = rytest::for_each_alloc_failure(
+        [&] { return sec__get_user_info(user.c_str(), &uid, home); },
+        [&](int32_t rc, long) {
+            EXPECT_EQ(rc, 6);
+            EXPECT_EQ(rytest::error_msgnum(), 89);
+            EXPECT_NE(rytest::error_text().find("sec__get_user_info"), std::string::npos);
+        });
+    EXPECT_EQ(sites, 1);
+}
+
+}  // namespace
