@@ -26,10 +26,10 @@ constexpr unsigned char C_END_MARK = C_TERM | C_NUL | C_HASH;
 struct class_table {
     unsigned char c[256] = {};
     constexpr class_table() {
-        c['\n'] = c['\f'] = c['\r'] = C_TERM;
+        for (unsigned char b : {'\n', '\f', '\r'}) c[b] = C_TERM;
+        for (unsigned char b : {' ', '\t', '\v'}) c[b] = C_BLANK;
         c[0] = C_NUL;
-        c[' '] = c['\t'] = c['\v'] = C_BLANK;
-        c['#'] = C_HASH;
+        c[static_cast<unsigned char>('#')] = C_HASH;
     }
 };
 constexpr class_table k_cls;
