@@ -39,8 +39,8 @@ int32_t open_vetted(const char *name, const struct stat &vetted, int *fd) {
         if (fl != -1) (void)fcntl(*fd, F_SETFL, fl & ~O_NONBLOCK);
         return 0;
     }
-    // The name was replaced between the lookup and the open.  No system
-    // call failed then, so the message carries errno 0.
+    // fstat failed (its errno is reported), or the name was replaced
+    // between the lookup and the open, which no errno describes: 0.
     close(*fd);
     *fd = -1;
     return acl::set_error(ACL_RC_BAD_FILE_NAME, 154, name, err);
