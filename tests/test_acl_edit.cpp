@@ -226,9 +226,15 @@ TEST(Edit, EachAllocationFailure) {
 // same random edits on both give the same bytes and codes at every step.
 TEST(Edit, DirectAndTreeRoadsAgree) {
     std::mt19937 rng(12345);
-    const char *names[] = {"a", "B", "b", "cc", "Cc", "d", "eee", "f", "G", "h", ""};
+    // Short names, and long ones sharing prefixes of a word and more, in
+    // either case, around the word boundary.
+    const char *names[] = {"a",         "B",          "b",           "cc",          "Cc",
+                           "eee",       "G",          "",            "service_a",   "service_",
+                           "SERVICE_b", "service_ab", "servicexa",   "service_long_name_1",
+                           "Service_Long_Name_1",     "service_long_name_2", "service_long_name_",
+                           "servicE_lonG_namE_10"};
     sec_buffer_desc fast{0, nullptr}, slow{0, nullptr};
-    for (int step = 0; step < 3000; ++step) {
+    for (int step = 0; step < 6000; ++step) {
         unsigned type = (rng() % 3 == 0) ? 16 : 4;
         const char *mech = rng() % 2 ? "unix" : "UNIX";
         std::string id = names[rng() % (sizeof names / sizeof *names)];

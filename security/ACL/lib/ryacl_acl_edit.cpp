@@ -103,6 +103,22 @@ struct scan_result {
     size_t size = 0;
     uint32_t count = 0;
 };
+// The tree's order (zo_strcasecmp_posix_1) of two texts of known lengths.
+// Bytes that are equal fold equal, so a common prefix is skipped a word at
+// a time and only the rest is compared; that keeps the one pass over a
+// large sub-ACL cheap.  Only whole words before the shorter text's end are
+// skipped, so the comparison never starts past either NUL.
+int order(const char *a, size_t alen, const char *b, size_t blen) {
+    const size_t n = alen < blen ? alen : blen;
+    size_t k = 0;
+    for (uint64_t wa, wb; k + 8 <= n; k += 8) {
+        std::memcpy(&wa, a + k, 8);
+        std::memcpy(&wb, b + k, 8);
+        if (wa != wb) break;
+    }
+    return zo_strcasecmp_posix_1(a + k, b + k);
+}
+
 scan_result scan_sorted(const unsigned char *base, const located &where, const char *id) {
     scan_result r;
     const unsigned char *sub = base + where.off;
@@ -118,7 +134,9 @@ scan_result scan_sorted(const unsigned char *base, const located &where, const c
     const uint32_t count = acl__load_le32(sub + 5);
     const size_t end = where.len;
     size_t pos = ACL_SUBACL_HDR_SIZE + mlen;
+    const size_t idtextlen = std::strlen(id);
     const char *prev = nullptr;
+    size_t prevlen = 0;
     bool placed = false;
     for (uint32_t i = 0; i < count; ++i) {
         if (end - pos < ACL_ENTRY_HDR_SIZE || sub[pos] != 1) return r;
@@ -126,9 +144,9 @@ scan_result scan_sorted(const unsigned char *base, const located &where, const c
         if (end - pos - ACL_ENTRY_HDR_SIZE < idlen || idlen == 0) return r;
         const char *eid = reinterpret_cast<const char *>(sub + pos + ACL_ENTRY_HDR_SIZE);
         if (strnlen(eid, idlen) + 1 != idlen) return r;
-        if (prev && zo_strcasecmp_posix_1(prev, eid) >= 0) return r;
+        if (prev && order(prev, prevlen, eid, idlen - 1) >= 0) return r;
         if (!placed) {
-            int c = zo_strcasecmp_posix_1(id, eid);
+            int c = order(id, idtextlen, eid, idlen - 1);
             if (c <= 0) {
                 placed = true;
                 r.match = c == 0;
@@ -137,6 +155,7 @@ scan_result scan_sorted(const unsigned char *base, const located &where, const c
             }
         }
         prev = eid;
+        prevlen = idlen - 1;
         pos += ACL_ENTRY_HDR_SIZE + idlen;
     }
     if (pos != end) return r;
