@@ -63,3 +63,22 @@ const char *acl__tree_mech(const sec_acltree_s *tree);
 // cannot be had.
 typedef bool (*acl__tree_visit_fn)(const acl__tree_entry_view *e, void *ctx);
 int32_t acl__tree_visit(sec_acltree_s *tree, acl__tree_visit_fn fn, void *ctx);
+// The same, naming `fname` in message 89.
+int32_t acl__tree_visit_named(sec_acltree_s *tree, acl__tree_visit_fn fn, void *ctx, const char *fname);
+
+// Insert an entry given as parts, for reading a sub-ACL back without a
+// temporary record.  mech (types 4, 8) and id (types 4, 8, 16) must be
+// NUL-terminated at mechlen and idlen; they are ignored for the other
+// types.  Same results as sec__add_acle_to_tree.
+int32_t acl__tree_insert(sec_acltree_t *node, sec_boolean_t single, unsigned char type, uint32_t perm,
+                         const char *mech, size_t mechlen, const char *id, size_t idlen);
+// Make room for `entries` more entries and `bytes` more identifier bytes,
+// so that a tree whose size is known grows once.  0, or 6 (message 89).
+int32_t acl__tree_reserve(sec_acltree_t tree, size_t entries, size_t bytes);
+// Without ordering anything: the number of present entries, the sum of
+// their identifier lengths and the longest one.
+void acl__tree_stats(const sec_acltree_s *tree, size_t *count, uint64_t *id_bytes, size_t *max_idlen);
+
+// Advise the kernel that a large block is worth backing with huge pages
+// (no effect on small blocks or where unsupported).
+void acl__advise_large(void *p, size_t n);

@@ -1,0 +1,312 @@
+// Scale of the checker: `ryaclfck -f FILE` and `ryaclfck -s -f FILE` as
+// whole processes, and the same library path in-process (parse, add to
+// trees, serialise), over generated files of 10^4, 10^5 and 10^6 entries,
+// sorted, reverse-sorted and shuffled, with one mechanism or one per entry.
+//
+// Next to each file a floor is measured in the same run: one read() of the
+// whole file and counting its lines with memchr.  After the runs a summary
+// prints the ratios the checker is held to:
+//   check <= 5x floor; sorted and reverse <= 1.2x shuffled; per-entry cost
+//   at 10^6 <= 2x that at 10^5; one mechanism per entry <= 2x one
+//   mechanism; -s adds <= 25%; peak RSS <= 5x the file size.
+#include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "acl_gen.h"
+#include "ryacl_acl_buffer.h"
+#include "ryacl_acl_entry.h"
+#include "ryacl_acl_tree.h"
+
+#ifndef RYACLFCK_PATH
+#error "RYACLFCK_PATH must name the built ryaclfck"
+#endif
+
+namespace {
+
+using ryacl_bench::order;
+using clock_type = std::chrono::steady_clock;
+
+struct config {
+    size_t n;
+    order ord;
+    bool own_mech;
+    std::string name() const {
+        return std::to_string(n) + "/" + ryacl_bench::order_name(ord) + "/" + (own_mech ? "own-mech" : "one-mech");
+    }
+    bool operator==(const config &o) const { return n == o.n && ord == o.ord && own_mech == o.own_mech; }
+};
+
+// One generated file at a time: 10^6-entry files are ~45 MB each.
+class files {
+public:
+    ~files() { drop(); if (!dir_.empty()) rmdir(dir_.c_str()); }
+    const std::string &get(const config &c, size_t *size) {
+        if (!(have_ && cur_ == c)) {
+            drop();
+            if (dir_.empty()) {
+                const char *t = std::getenv("TMPDIR");
+                std::string tmpl = std::string(t && *t ? t : "/tmp") + "/ryacl_bench.XXXXXX";
+                std::vector<char> b(tmpl.begin(), tmpl.end());
+                b.push_back('\0');
+                if (!mkdtemp(b.data())) std::abort();
+                dir_ = b.data();
+            }
+            path_ = dir_ + "/bench.acl";
+            ryacl_bench::gen_options o;
+            o.entries = c.n;
+            o.ord = c.ord;
+            o.mechanisms = c.own_mech ? c.n : 1;
+            o.seed = 42;
+            if (!ryacl_bench::write_acl_file(path_, o)) std::abort();
+            struct stat st;
+            stat(path_.c_str(), &st);
+            size_ = static_cast<size_t>(st.st_size);
+            cur_ = c;
+            have_ = true;
+        }
+        *size = size_;
+        return path_;
+    }
+
+private:
+    void drop() {
+        if (!have_) return;
+        unlink(path_.c_str());
+        unlink((path_ + ".cacl").c_str());
+        have_ = false;
+    }
+    std::string dir_, path_;
+    config cur_{0, order::sorted, false};
+    bool have_ = false;
+    size_t size_ = 0;
+};
+
+files g_files;
+
+struct result {
+    double best = 1e99;  // seconds, fastest iteration
+    long max_rss_kb = 0;
+    size_t file_size = 0;
+};
+std::map<std::string, result> g_results;  // "kind|config"
+
+double seconds_since(clock_type::time_point t0) {
+    return std::chrono::duration<double>(clock_type::now() - t0).count();
+}
+
+size_t floor_once(const std::string &path) {
+    int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+    struct stat st;
+    fstat(fd, &st);
+    size_t size = static_cast<size_t>(st.st_size);
+    char *buf = static_cast<char *>(std::malloc(size + 1));
+    ssize_t r = read(fd, buf, size);
+    close(fd);
+    size_t lines = 0;
+    const char *p = buf, *end = buf + (r > 0 ? r : 0);
+    while ((p = static_cast<const char *>(std::memchr(p, '\n', static_cast<size_t>(end - p)))) != nullptr) {
+        ++lines;
+        ++p;
+    }
+    std::free(buf);
+    return lines;
+}
+
+void bm_floor(benchmark::State &state, config c) {
+    size_t size = 0;
+    const std::string &path = g_files.get(c, &size);
+    result &r = g_results["floor|" + c.name()];
+    r.file_size = size;
+    for (auto _ : state) {
+        auto t0 = clock_type::now();
+        benchmark::DoNotOptimize(floor_once(path));
+        double s = seconds_since(t0);
+        state.SetIterationTime(s);
+        if (s < r.best) r.best = s;
+    }
+}
+
+// Run ryaclfck as a real process; its exit status and peak RSS.
+int run_checker(const std::string &path, bool cache, long *max_rss_kb) {
+    pid_t pid = fork();
+    if (pid == 0) {
+        int devnull = open("/dev/null", O_WRONLY);
+        dup2(devnull, 1);
+        dup2(devnull, 2);
+        if (cache) execl(RYACLFCK_PATH, "ryaclfck", "-s", "-f", path.c_str(), static_cast<char *>(nullptr));
+        else execl(RYACLFCK_PATH, "ryaclfck", "-f", path.c_str(), static_cast<char *>(nullptr));
+        _exit(127);
+    }
+    int status = 0;
+    struct rusage ru {};
+    wait4(pid, &status, 0, &ru);
+    *max_rss_kb = ru.ru_maxrss;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+void bm_check(benchmark::State &state, config c, bool cache) {
+    size_t size = 0;
+    const std::string &path = g_files.get(c, &size);
+    result &r = g_results[std::string(cache ? "check-s|" : "check|") + c.name()];
+    r.file_size = size;
+    for (auto _ : state) {
+        long rss = 0;
+        auto t0 = clock_type::now();
+        int st = run_checker(path, cache, &rss);
+        double s = seconds_since(t0);
+        state.SetIterationTime(s);
+        if (st != 0) {
+            state.SkipWithError(("ryaclfck exited with " + std::to_string(st)).c_str());
+            break;
+        }
+        if (s < r.best) r.best = s;
+        if (rss > r.max_rss_kb) r.max_rss_kb = rss;
+    }
+    state.counters["rss_x_file"] = static_cast<double>(r.max_rss_kb) * 1024.0 / static_cast<double>(size);
+}
+
+// The library path the checker takes, in-process: read, parse, add to the
+// trees, serialise, release.
+void bm_library(benchmark::State &state, config c) {
+    size_t size = 0;
+    const std::string &path = g_files.get(c, &size);
+    result &r = g_results["lib|" + c.name()];
+    r.file_size = size;
+    for (auto _ : state) {
+        auto t0 = clock_type::now();
+        int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
+        char *buf = static_cast<char *>(std::malloc(size + 1));
+        if (read(fd, buf, size) != static_cast<ssize_t>(size)) std::abort();
+        close(fd);
+        buf[size] = '\0';
+        char *cursor = buf;
+        size_t left = size + 1;
+        int32_t lineno = 1;
+        acl__trees_s trees;
+        int32_t rc;
+        for (;;) {
+            sec_acle_desc acle{};
+            rc = sec__read_acle_from_text(nullptr, &cursor, &left, &lineno, &acle);
+            if (rc == 0) break;
+            if (rc != 1) break;
+            if (acle.type && (rc = sec__add_acle_to_trees(&acle, &trees)) != 0) break;
+        }
+        sec_buffer_desc acl{0, nullptr};
+        if (rc == 0) rc = sec__acltrees_to_acl(&trees, &acl);
+        std::free(acl.value);
+        acl__free_trees(&trees);
+        std::free(buf);
+        double s = seconds_since(t0);
+        state.SetIterationTime(s);
+        if (rc != 0) {
+            state.SkipWithError(("library path failed with " + std::to_string(rc)).c_str());
+            break;
+        }
+        if (s < r.best) r.best = s;
+    }
+}
+
+const size_t kSizes[] = {10000, 100000, 1000000};
+const order kOrders[] = {order::sorted, order::reverse, order::shuffled};
+
+void register_all() {
+    for (size_t n : kSizes)
+        for (bool own : {false, true})
+            for (order o : kOrders) {
+                config c{n, o, own};
+                int iters = n >= 1000000 ? 3 : (n >= 100000 ? 8 : 30);
+                auto reg = [&](const std::string &kind, auto fn) {
+                    benchmark::RegisterBenchmark((kind + "/" + c.name()).c_str(), fn)
+                        ->UseManualTime()
+                        ->Unit(benchmark::kMillisecond)
+                        ->Iterations(iters);
+                };
+                reg("floor", [c](benchmark::State &s) { bm_floor(s, c); });
+                reg("check", [c](benchmark::State &s) { bm_check(s, c, false); });
+                reg("check-s", [c](benchmark::State &s) { bm_check(s, c, true); });
+                reg("lib", [c](benchmark::State &s) { bm_library(s, c); });
+            }
+}
+
+const result *find(const std::string &kind, const config &c) {
+    auto it = g_results.find(kind + "|" + c.name());
+    return it == g_results.end() || it->second.best >= 1e98 ? nullptr : &it->second;
+}
+
+void line(const char *what, const std::string &where, double ratio, double limit) {
+    std::printf("  %-34s %-30s %7.2f  (limit %.2f) %s\n", what, where.c_str(), ratio, limit,
+                ratio <= limit ? "ok" : "OVER");
+}
+
+void summary() {
+    std::printf("\nSummary (fastest iteration of each)\n");
+    std::printf("  %-34s %-30s %7s\n", "ratio", "file", "value");
+    for (size_t n : kSizes)
+        for (bool own : {false, true})
+            for (order o : kOrders) {
+                config c{n, o, own};
+                const result *fl = find("floor", c);
+                for (const char *kind : {"check", "check-s"}) {
+                    const result *ck = find(kind, c);
+                    if (!fl || !ck) continue;
+                    line((std::string(kind) + " / floor").c_str(), c.name(), ck->best / fl->best, 5.0);
+                    line((std::string(kind) + " peak RSS / file size").c_str(), c.name(),
+                         static_cast<double>(ck->max_rss_kb) * 1024.0 / static_cast<double>(ck->file_size), 5.0);
+                }
+                if (const result *lib = find("lib", c); lib && fl)
+                    line("lib / floor", c.name(), lib->best / fl->best, 5.0);
+                const result *ck = find("check", c), *cs = find("check-s", c);
+                if (ck && cs) line("check -s / check", c.name(), cs->best / ck->best, 1.25);
+            }
+    for (const char *kind : {"check", "check-s", "lib"})
+        for (size_t n : kSizes)
+            for (bool own : {false, true}) {
+                const result *sh = find(kind, config{n, order::shuffled, own});
+                for (order o : {order::sorted, order::reverse}) {
+                    config c{n, o, own};
+                    const result *r = find(kind, c);
+                    if (r && sh)
+                        line((std::string(kind) + " " + ryacl_bench::order_name(o) + " / shuffled").c_str(), c.name(),
+                             r->best / sh->best, 1.2);
+                }
+                for (order o : kOrders) {
+                    config one{n, o, false}, own_c{n, o, true};
+                    const result *a = find(kind, one), *b = find(kind, own_c);
+                    if (own && a && b)
+                        line((std::string(kind) + " own-mech / one-mech").c_str(), own_c.name(), b->best / a->best,
+                             2.0);
+                }
+            }
+    for (const char *kind : {"check", "check-s", "lib"})
+        for (bool own : {false, true})
+            for (order o : kOrders) {
+                const result *big = find(kind, config{1000000, o, own}), *mid = find(kind, config{100000, o, own});
+                if (big && mid)
+                    line((std::string(kind) + " per entry 10^6 / 10^5").c_str(), config{1000000, o, own}.name(),
+                         (big->best / 1e6) / (mid->best / 1e5), 2.0);
+            }
+}
+
+}  // namespace
+
+int main(int argc, char **argv) {
+    register_all();
+    benchmark::Initialize(&argc, argv);
+    if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
+    benchmark::RunSpecifiedBenchmarks();
+    benchmark::Shutdown();
+    summary();
+    return 0;
+}

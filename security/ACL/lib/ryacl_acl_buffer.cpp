@@ -1,0 +1,279 @@
+// The compiled ACL: serialising trees into sub-ACLs and whole buffers,
+// reading a sub-ACL back into a tree, finding a sub-ACL.
+//
+// Writers size the result first and allocate it once, so the cost is that
+// of the bytes written.  Readers take buffers that may come from outside
+// unvalidated: every count and length is checked against the bytes that
+// are really there before it is followed.
+#include "ryacl_acl_buffer.h"
+
+#include <cstdlib>
+#include <cstring>
+
+#include "ry_zo_int.h"
+#include "ryacl_acl_entry.h"
+#include "ryacl_alloc.h"
+#include "ryacl_error.h"
+
+namespace {
+
+constexpr size_t kMechField = 17;  // the entry record's mechanism field
+
+int32_t size_arg(size_t n) { return n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n); }
+
+// Size of the sub-ACL a tree serialises to (0 for a tree without entries)
+// and its entry count.  Refuses what the layout cannot hold instead of
+// writing a wrapped 16-bit length or an over-long 32-bit one:
+//  - an identifier over 65534 bytes: 43 with message 95, the message for an
+//    entry whose identifier is not valid;
+//  - a sub-ACL over INT32_MAX bytes: 6 with message 89, the allocation the
+//    layout cannot express (the size shown is capped at INT32_MAX).
+int32_t subacl_size(sec_acltree_s *tree, const char *fname, size_t *size, size_t *count) {
+    uint64_t id_bytes = 0;
+    size_t max_idlen = 0;
+    acl__tree_stats(tree, count, &id_bytes, &max_idlen);
+    *size = 0;
+    if (*count == 0) return 0;
+    const unsigned char type = acl__tree_type(tree);
+    if (max_idlen > ACL_MAX_IDLEN) return acl::set_error(ACL_RC_BAD_ACLE, 95);
+    uint64_t total = ACL_SUBACL_HDR_SIZE;
+    if (acl__type_has_mech(type)) total += std::strlen(acl__tree_mech(tree)) + 1;
+    total += uint64_t{*count} * ACL_ENTRY_HDR_SIZE;
+    if (acl__type_has_id(type)) total += id_bytes + *count;
+    if (total > INT32_MAX) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, INT32_MAX);
+    *size = static_cast<size_t>(total);
+    return 0;
+}
+
+struct writer {
+    unsigned char *p;
+    size_t left;
+    bool overflow = false;
+};
+
+bool write_entry(const acl__tree_entry_view *e, void *ctx) {
+    auto *w = static_cast<writer *>(ctx);
+    const size_t idfield = e->id ? e->idlen + 1 : 0;
+    if (w->left < ACL_ENTRY_HDR_SIZE + idfield) {
+        w->overflow = true;
+        return false;
+    }
+    unsigned char *p = w->p;
+    p[0] = 1;
+    acl__store_le32(p + 1, e->perm);
+    acl__store_le16(p + 5, static_cast<uint16_t>(idfield));
+    if (idfield) std::memcpy(p + ACL_ENTRY_HDR_SIZE, e->id, idfield);
+    w->p += ACL_ENTRY_HDR_SIZE + idfield;
+    w->left -= ACL_ENTRY_HDR_SIZE + idfield;
+    return true;
+}
+
+// Lay down the sub-ACL of `tree` in exactly `size` bytes at dst.
+int32_t write_subacl(sec_acltree_s *tree, unsigned char *dst, size_t size, size_t count,
+                     const char *fname) {
+    const unsigned char type = acl__tree_type(tree);
+    size_t mechfield = 0;
+    acl__store_le32(dst, static_cast<uint32_t>(size));
+    dst[4] = type;
+    acl__store_le32(dst + 5, static_cast<uint32_t>(count));
+    if (acl__type_has_mech(type)) {
+        const char *mech = acl__tree_mech(tree);
+        mechfield = std::strlen(mech) + 1;
+        std::memcpy(dst + ACL_SUBACL_HDR_SIZE, mech, mechfield);
+    }
+    dst[9] = static_cast<unsigned char>(mechfield);
+    writer w{dst + ACL_SUBACL_HDR_SIZE + mechfield, size - ACL_SUBACL_HDR_SIZE - mechfield};
+    if (int32_t rc = acl__tree_visit_named(tree, write_entry, &w, fname)) return rc;
+    // The sizes come from the same entries; a mismatch is a defect here.
+    if (w.overflow || w.left != 0) return acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    return 0;
+}
+
+int32_t bad_structure(int line) {
+    return acl::set_error(ACL_RC_BAD_ACL, 97, "security/ACL/lib/ryacl_acl", line);
+}
+
+}  // namespace
+
+int32_t sec__acltree_to_subacl(sec_acltree_s *tree, unsigned char **subacl, size_t *sublen) {
+    const char *fname = "sec__acltree_to_subacl";
+    if (!subacl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    *subacl = nullptr;
+    if (sublen) *sublen = 0;
+    size_t size = 0, count = 0;
+    if (int32_t rc = subacl_size(tree, fname, &size, &count)) return rc;
+    if (size == 0) return 0;
+    auto *block = static_cast<unsigned char *>(acl__malloc(size));
+    if (!block) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(size));
+    if (int32_t rc = write_subacl(tree, block, size, count, fname)) {
+        std::free(block);
+        return rc;
+    }
+    *subacl = block;
+    if (sublen) *sublen = size;
+    return 0;
+}
+
+int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
+    const char *fname = "sec__acltrees_to_acl";
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    acl->length = 0;
+    acl->value = nullptr;
+    const int32_t n = trees ? trees->nooftrees : 0;
+    uint64_t total = ACL_HDR_SIZE;
+    size_t nsub = 0;
+    for (int32_t s = n; s-- > 0;) {
+        size_t size = 0, count = 0;
+        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) return rc;
+        if (!size) continue;
+        total += size;
+        ++nsub;
+        // Past 65535 sub-ACLs or INT32_MAX bytes the layout cannot say what
+        // it holds: refused as an allocation beyond the buffer's own limit
+        // (6, message 89), like an over-long sub-ACL.
+        if (nsub > ACL_MAX_SUBACLS || total > INT32_MAX)
+            return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+    }
+    auto *buf = static_cast<unsigned char *>(acl__malloc(static_cast<size_t>(total)));
+    if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+    acl__advise_large(buf, static_cast<size_t>(total));
+    buf[0] = ACL_BUF_TYPE;
+    buf[1] = ACL_BUF_VERSION;
+    buf[2] = ACL_BUF_HOST_ORDER;
+    acl__store_le16(buf + 3, static_cast<uint16_t>(nsub));
+    size_t off = ACL_HDR_SIZE;
+    for (int32_t s = n; s-- > 0;) {
+        size_t size = 0, count = 0;
+        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) {
+            std::free(buf);
+            return rc;
+        }
+        if (!size) continue;
+        if (int32_t rc = write_subacl(trees->trees[s], buf + off, size, count, fname)) {
+            std::free(buf);
+            return rc;
+        }
+        off += size;
+    }
+    acl->length = static_cast<int32_t>(total);
+    acl->value = buf;
+    return 0;
+}
+
+// Every refusal below is of a sub-ACL that did not come from this
+// library's writers; validation would have reported the same faults:
+//  - structure running past `avail` (header, mechanism, an entry header or
+//    identifier cut off): 42 with message 97, the corrupted-buffer message;
+//  - a type that is none of the five: 42 with message 107;
+//  - a type 1 or 2 sub-ACL counting more than one entry: 42 with message 98;
+//  - a mechanism length field outside 2 to 17 for types 4 and 8 (it could
+//    not fit the entry record's 17-byte field): 42 with message 110;
+//  - a mechanism whose text and length disagree: 42 with message 111;
+//  - an identifier of types 4, 8 or 16 whose length field is 0 or whose
+//    text does not end exactly at its length: 43 with message 114.
+// Entry versions are not looked at, as before.
+int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree_t *tree) {
+    if (!tree) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 3, 0);
+    *tree = nullptr;
+    if (!p) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 1, 0);
+    if (avail < ACL_SUBACL_HDR_SIZE) return bad_structure(__LINE__);
+    const unsigned char type = p[4];
+    const uint32_t count = acl__load_le32(p + 5);
+    const size_t mechlen = p[9];
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, 107, type, ACL_LOC_ACL);
+    if ((type == SEC_ACLE_TYPE_UNAUTHENTICATED || type == SEC_ACLE_TYPE_ANYOTHER) && count > 1)
+        return acl::set_error(ACL_RC_BAD_ACL, 98);
+    if (ACL_SUBACL_HDR_SIZE + mechlen > avail) return bad_structure(__LINE__);
+    char mech[kMechField] = {};
+    const bool with_mech = acl__type_has_mech(type);
+    if (with_mech) {
+        if (mechlen < 2 || mechlen > kMechField)
+            return acl::set_error(ACL_RC_BAD_ACL, 110, static_cast<int>(mechlen), ACL_LOC_ACL);
+        std::memcpy(mech, p + ACL_SUBACL_HDR_SIZE, mechlen - 1);
+        if (std::strlen(mech) != mechlen - 1 || p[ACL_SUBACL_HDR_SIZE + mechlen - 1] != '\0')
+            return acl::set_error(ACL_RC_BAD_ACL, 111, mech, ACL_LOC_ACL);
+    }
+    // Types 1, 2 and 16 carry no mechanism; a length field there is skipped
+    // over, as the entries are located after it.
+    size_t pos = ACL_SUBACL_HDR_SIZE + mechlen;
+    const bool with_id = acl__type_has_id(type);
+    const size_t sublen = acl__load_le32(p);
+    const size_t bound = sublen < avail ? sublen : avail;  // only a sizing hint
+    sec_acltree_t t = nullptr;
+    int32_t rc = 0;
+    for (uint32_t k = 0; k < count; ++k) {
+        if (avail - pos < ACL_ENTRY_HDR_SIZE) {
+            rc = bad_structure(__LINE__);
+            break;
+        }
+        const unsigned char *e = p + pos;
+        const uint32_t perm = acl__load_le32(e + 1);
+        const size_t idlen = acl__load_le16(e + 5);
+        if (avail - pos - ACL_ENTRY_HDR_SIZE < idlen) {
+            rc = bad_structure(__LINE__);
+            break;
+        }
+        const char *id = reinterpret_cast<const char *>(e + ACL_ENTRY_HDR_SIZE);
+        if (with_id && (idlen == 0 || std::memchr(id, '\0', idlen) != id + idlen - 1)) {
+            rc = acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+            break;
+        }
+        // A sub-ACL holding one identifier twice keeps the later permission.
+        rc = acl__tree_insert(&t, 0, type, perm, mech, with_mech ? mechlen - 1 : 0, with_id ? id : "",
+                              with_id ? idlen - 1 : 0);
+        if (rc) break;
+        pos += ACL_ENTRY_HDR_SIZE + idlen;
+        if (k == 0 && count > 1) {
+            // Grow once.  The counts may lie, so the room asked for is what
+            // the bytes present could hold, not what the header claims.
+            size_t rest = bound > pos ? bound - pos : 0;
+            size_t more = rest / (ACL_ENTRY_HDR_SIZE + (with_id ? 1 : 0));
+            if (more > count - 1) more = count - 1;
+            rc = acl__tree_reserve(t, more, rest);
+            if (rc) break;
+        }
+    }
+    if (rc) {
+        sec__free_acltree(t);
+        return rc;
+    }
+    *tree = t;
+    return 0;
+}
+
+int32_t sec__find_subacl(const sec_acl_buffer_desc *acl, unsigned char type, const char *mech,
+                         unsigned char **subacl) {
+    if (!subacl) return 0;
+    *subacl = nullptr;
+    if (!acl || !acl->value || acl->length < ACL_HDR_SIZE) return 0;
+    auto *p = static_cast<unsigned char *>(acl->value);
+    const size_t len = static_cast<size_t>(acl->length);
+    const unsigned nsub = acl__load_le16(p + 3);
+    const bool by_mech = acl__type_has_mech(type);
+    // Without a mechanism a user or expanded sub-ACL cannot be named.
+    if (by_mech && !mech) return 0;
+    size_t pos = ACL_HDR_SIZE;
+    for (unsigned k = 0; k < nsub; ++k) {
+        if (len - pos < ACL_SUBACL_HDR_SIZE) return 0;
+        const size_t sublen = acl__load_le32(p + pos);
+        // A length of 0 would never move on, one past the end has nothing
+        // behind it to find: either ends the walk.
+        if (sublen < ACL_SUBACL_HDR_SIZE || sublen > len - pos) return 0;
+        const unsigned char *s = p + pos;
+        if (s[4] == type) {
+            if (!by_mech) {
+                *subacl = p + pos;
+                return 0;
+            }
+            const size_t mechlen = s[9];
+            if (mechlen >= 1 && mechlen <= kMechField && ACL_SUBACL_HDR_SIZE + mechlen <= sublen &&
+                s[ACL_SUBACL_HDR_SIZE + mechlen - 1] == '\0' &&
+                zo_strcasecmp_posix_1(mech, reinterpret_cast<const char *>(s + ACL_SUBACL_HDR_SIZE)) == 0) {
+                *subacl = p + pos;
+                return 0;
+            }
+        }
+        pos += sublen;
+    }
+    return 0;
+}
