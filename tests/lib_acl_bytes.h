@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <initializer_list>
 #include <string>
 #include <utility>
 #include <vector>
@@ -77,6 +78,25 @@ inline void drop(sec_buffer_desc &d) {
     std::free(d.value);
     d.value = nullptr;
     d.length = 0;
+}
+
+// Mutants of a valid buffer: every bit flipped, every byte value (every
+// `step`-th) at the offsets given, every truncation.
+inline std::vector<bytes> mutants(const bytes &base, std::initializer_list<size_t> offsets,
+                                  unsigned step = 1) {
+    std::vector<bytes> out;
+    for (size_t i = 0; i < base.size() * 8; ++i) {
+        out.push_back(base);
+        out.back()[i / 8] ^= static_cast<unsigned char>(1u << (i % 8));
+    }
+    for (size_t off : offsets) {
+        for (unsigned v = 0; v < 256; v += step) {
+            out.push_back(base);
+            out.back()[off] = static_cast<unsigned char>(v);
+        }
+    }
+    for (size_t n = 0; n < base.size(); ++n) out.emplace_back(base.begin(), base.begin() + n);
+    return out;
 }
 
 // Entries of a list as "type:mech:id:perm" strings.
