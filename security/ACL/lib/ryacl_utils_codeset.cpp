@@ -60,10 +60,14 @@ int32_t convert(zo_iconv_t handle, const char *fn, const char *in, size_t *inlen
     case ZO_ICONV_RC_BAD_HANDLE:
     case ZO_ICONV_RC_BAD_ARGS:
         return acl::set_error(ACL_RC_INTERNAL, 91, at.file, at.line, zrc);
-    case ZO_ICONV_RC_NO_MEMORY:
+    case ZO_ICONV_RC_NO_MEMORY: {
         // For the direction to UTF-8 the converter has put the size it
-        // could not allocate into the output length.
-        return acl::set_error(ACL_RC_NO_MEMORY, 89, fn, utf8_length ? *utf8_length : 0);
+        // could not allocate into the output length; the caller gets its
+        // output length back as it gave it.
+        const size_t attempted = utf8_length ? *utf8_length : 0;
+        *outlen = 0;
+        return acl::set_error(ACL_RC_NO_MEMORY, 89, fn, attempted);
+    }
     default:
         return acl::set_error(ACL_RC_CODESET, 130);
     }
