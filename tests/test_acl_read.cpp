@@ -2,7 +2,6 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
-#include <pwd.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -247,28 +246,6 @@ TEST(ReadFile, EmptyFilesCommentsAndFailures) {
         EXPECT_EQ(d.length, 0);
         EXPECT_EQ(d.value, nullptr);
     }
-}
-
-TEST(ReadFile, OwnerAndWriteBitsWithAUser) {
-    struct passwd *pw = getpwuid(getuid());
-    ASSERT_NE(pw, nullptr);
-    const std::string name = "ryacl_read_test_" + std::to_string(getpid()) + ".acl";
-    const std::string path = std::string(pw->pw_dir) + "/" + name;
-    rytest::write_file(path, kText, 0644);
-    for (mode_t mode : {0620, 0602, 0644}) {
-        chmod(path.c_str(), mode);
-        sec_buffer_desc d{0, nullptr};
-        int32_t rc = sec_read_acl_file(name.c_str(), pw->pw_name, nullptr, SEC_ACLF_FROM_TEXT, &d, nullptr);
-        if (mode == 0644) {
-            EXPECT_EQ(rc, 0);
-            EXPECT_EQ(view(d), compiled());
-        } else {
-            EXPECT_EQ(rc, ACL_RC_PERMISSION) << std::oct << mode;
-            EXPECT_EQ(rytest::error_msgnum(), 128);
-        }
-        sec_release_acl(&d);
-    }
-    unlink(path.c_str());
 }
 
 // Each allocation of a read that compiles the text and stores the cache
