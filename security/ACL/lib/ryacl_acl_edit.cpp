@@ -230,6 +230,24 @@ int32_t direct_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &
 
 // ---- The tree road ------------------------------------------------------------
 
+// Whether the sub-ACLs the header counts, stepped through by their lengths,
+// end exactly at the end of the block.  An appended sub-ACL is counted as
+// the one after the last; if other bytes lay there (bytes after the last
+// sub-ACL, or entries running past its length, both of which validation
+// lets pass), counting one more would bring them to life as a sub-ACL that
+// nobody validated.
+bool counted_subacls_fill(const unsigned char *base, size_t total) {
+    const unsigned nsub = acl__load_le16(base + 3);
+    size_t pos = ACL_HDR_SIZE;
+    for (unsigned k = 0; k < nsub; ++k) {
+        if (total - pos < ACL_SUBACL_HDR_SIZE) return false;
+        const size_t len = acl__load_le32(base + pos);
+        if (len < ACL_SUBACL_HDR_SIZE || len > total - pos) return false;
+        pos += len;
+    }
+    return pos == total;
+}
+
 // Put `fresh` in place of the sub-ACL at `where`, or append it when there
 // is none.  A growing block is reallocated before the first byte changes,
 // so a failure leaves the ACL as it was.  `who` names the operation in a
@@ -243,6 +261,7 @@ int32_t splice(sec_acl_buffer_t acl, const located &where, const unsigned char *
     // so the ACL is refused as unable to take it.
     if (!where.off && acl__load_le16(base + 3) == ACL_MAX_SUBACLS)
         return acl::set_error(ACL_RC_BAD_ACL, 93);
+    if (!where.off && !counted_subacls_fill(base, total)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
     const size_t at = where.off ? where.off : total;
     if (freshlen > old) {
         const size_t grow = freshlen - old;
