@@ -171,7 +171,10 @@ void BM_EditLargeVsCopy(benchmark::State &state) {
     }
     state.counters["add_vs_copy"] = add_ns / copy_ns;
     state.counters["del_vs_copy"] = del_ns / copy_ns;
-    state.counters["copy_us"] = copy_ns / 1000 / static_cast<double>(state.iterations());
+    const double per = 1000.0 * static_cast<double>(state.iterations());
+    state.counters["add_us"] = add_ns / per;
+    state.counters["del_us"] = del_ns / per;
+    state.counters["copy_us"] = copy_ns / per;
     sec_release_acl(&d);
 }
 BENCHMARK(BM_EditLargeVsCopy)->Unit(benchmark::kMicrosecond);

@@ -11,6 +11,7 @@
 //
 // The caller's buffer may not have been validated: the sub-ACL found must
 // lie inside the block, and its reading is bounded by its own length.
+#include <bit>
 #include <cstdlib>
 #include <cstring>
 
@@ -114,7 +115,13 @@ int order(const char *a, size_t alen, const char *b, size_t blen) {
     for (uint64_t wa, wb; k + 8 <= n; k += 8) {
         std::memcpy(&wa, a + k, 8);
         std::memcpy(&wb, b + k, 8);
-        if (wa != wb) break;
+        if (wa != wb) {
+            // Start at the first byte that differs (the lowest one in a
+            // little-endian load).
+            if constexpr (std::endian::native == std::endian::little)
+                k += static_cast<size_t>(std::countr_zero(wa ^ wb)) / 8;
+            break;
+        }
     }
     return zo_strcasecmp_posix_1(a + k, b + k);
 }
