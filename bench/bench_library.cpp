@@ -122,12 +122,15 @@ BENCHMARK(BM_EvalVsBareWalk)
     ->ArgsProduct({{10, 100, 1000, 10000}, {0, 1}})
     ->ArgNames({"entries", "handler"});
 
-// Throughput of evaluations from one and from two threads on one buffer.
+// Throughput of evaluations from one and from two threads on one buffer,
+// with and without the identity handler.
 void BM_EvalThreads(benchmark::State &state) {
     const int n = static_cast<int>(state.range(0));
+    const unsigned char type = state.range(1) ? 0x84 : 0x04;
     static bytes acl;
     static sec_buffer_desc d;
     if (state.thread_index() == 0) {
+        sec__register_id_handler(SEC_ID_HANDLER_USER, "unix", same_handler);
         acl = user_acl(n);
         d = sec_buffer_desc{static_cast<int32_t>(acl.size()), acl.data()};
     }
@@ -135,12 +138,17 @@ void BM_EvalThreads(benchmark::State &state) {
     const std::string id = user_id(n / 2 + state.thread_index() % (n / 2));
     for (auto _ : state) {
         uint32_t perm = 0;
-        sec__single_acle_perm(&d, 4, "unix", nullptr, id.c_str(), &perm);
+        sec__single_acle_perm(&d, type, "unix", nullptr, id.c_str(), &perm);
         benchmark::DoNotOptimize(perm);
     }
     state.SetItemsProcessed(state.iterations());
 }
-BENCHMARK(BM_EvalThreads)->Arg(100)->Arg(1000)->Threads(1)->Threads(2)->UseRealTime();
+BENCHMARK(BM_EvalThreads)
+    ->ArgsProduct({{10, 100, 1000, 10000}, {0, 1}})
+    ->ArgNames({"entries", "handler"})
+    ->Threads(1)
+    ->Threads(2)
+    ->UseRealTime();
 
 // Adding to and deleting from a sub-ACL of 100,000 entries, each against
 // one copy of the whole buffer.
