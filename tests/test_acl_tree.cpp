@@ -26,6 +26,17 @@ sec_acle_desc entry(unsigned char type, uint32_t perm, const char *mech, const c
     return e;
 }
 
+int32_t add(sec_acltree_t *t, unsigned char type, const std::string &id, uint32_t perm = 1,
+            const char *mech = "unix", sec_boolean_t single = 1) {
+    sec_acle_desc e = entry(type, perm, mech, id.c_str());
+    return sec__add_acle_to_tree(single, &e, t);
+}
+
+int32_t del(sec_acltree_t t, unsigned char type, const char *id, const char *mech = "unix") {
+    sec_acle_desc e = entry(type, 0, mech, id);
+    return sec__del_acle_from_tree(&e, t);
+}
+
 struct seen {
     std::string mech, id;
     uint32_t perm;
@@ -84,10 +95,7 @@ TEST(AclTree, UserAndGroupComeOutSortedWhateverTheInsertionOrder) {
         for (unsigned seed : {1u, 2u, 3u}) {
             std::vector<std::string> v = awkward_ids(3000, seed);
             sec_acltree_t t = nullptr;
-            for (auto &s : v) {
-                sec_acle_desc e = entry(type, 1, "unix", s.c_str());
-                ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-            }
+            for (auto &s : v) ASSERT_EQ(add(&t, type, s), 0);
             EXPECT_EQ(ids(t), expected_order(v));
             EXPECT_EQ(acl__tree_count(t), v.size());
             sec__free_acltree(t);
@@ -96,45 +104,30 @@ TEST(AclTree, UserAndGroupComeOutSortedWhateverTheInsertionOrder) {
     // Descending input, and an ascending prefix with an unsorted tail.
     std::vector<std::string> v = expected_order(awkward_ids(500, 9));
     sec_acltree_t down = nullptr, tail = nullptr;
-    for (size_t i = v.size(); i-- > 0;) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", v[i].c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &down), 0);
-    }
-    for (size_t i = 0; i < v.size(); i += 2) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", v[i].c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &tail), 0);
-    }
-    for (size_t i = 1; i < v.size(); i += 2) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", v[v.size() - i].c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &tail), 0);
-    }
+    for (size_t i = v.size(); i-- > 0;) ASSERT_EQ(add(&down, SEC_ACLE_TYPE_USER, v[i]), 0);
+    for (size_t i = 0; i < v.size(); i += 2) ASSERT_EQ(add(&tail, SEC_ACLE_TYPE_USER, v[i]), 0);
+    for (size_t i = 1; i < v.size(); i += 2) ASSERT_EQ(add(&tail, SEC_ACLE_TYPE_USER, v[v.size() - i]), 0);
     EXPECT_EQ(ids(down), v);
     EXPECT_EQ(ids(tail), v);
     sec__free_acltree(down);
     sec__free_acltree(tail);
-}
 
-TEST(AclTree, ExpandedKeepInsertionOrder) {
-    std::vector<std::string> v = {"zeta", "Alpha", "mid", "alphA2", "0"};
+    // Expanded entries keep their insertion order.
+    std::vector<std::string> x = {"zeta", "Alpha", "mid", "alphA2", "0"};
     sec_acltree_t t = nullptr;
-    for (auto &s : v) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_EXPANDED, 2, "krb", s.c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-    }
-    EXPECT_EQ(ids(t), v);
+    for (auto &s : x) ASSERT_EQ(add(&t, SEC_ACLE_TYPE_EXPANDED, s), 0);
+    EXPECT_EQ(ids(t), x);
     sec__free_acltree(t);
 }
 
 TEST(AclTree, DuplicatesRefusedOrReplacedKeepingTheFirstSpelling) {
     sec_acltree_t t = nullptr;
-    sec_acle_desc bob = entry(SEC_ACLE_TYPE_USER, 1, "unix", "Bob");
-    sec_acle_desc bob2 = entry(SEC_ACLE_TYPE_USER, 3, "UNIX", "bob");
-    ASSERT_EQ(sec__add_acle_to_tree(1, &bob, &t), 0);
-    EXPECT_EQ(sec__add_acle_to_tree(1, &bob2, &t), ACL_RC_BAD_ACLE);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "Bob", 1, "unix"), 0);
+    EXPECT_EQ(add(&t, SEC_ACLE_TYPE_USER, "bob", 3, "UNIX"), ACL_RC_BAD_ACLE);
     EXPECT_EQ(rytest::error_msgnum(), 144);
     EXPECT_NE(rytest::error_text().find("ACLE type: u; mechanism: UNIX; identity: bob."), std::string::npos);
     EXPECT_EQ(in_order(t)[0].perm, 1u);
-    EXPECT_EQ(sec__add_acle_to_tree(0, &bob2, &t), 0);
+    EXPECT_EQ(add(&t, SEC_ACLE_TYPE_USER, "bob", 3, "UNIX", 0), 0);
     auto r = in_order(t);
     ASSERT_EQ(r.size(), 1u);
     EXPECT_EQ(r[0].id, "Bob");
@@ -144,13 +137,10 @@ TEST(AclTree, DuplicatesRefusedOrReplacedKeepingTheFirstSpelling) {
 
     // The same once the tree has left its one-entry form.
     t = nullptr;
-    sec_acle_desc a = entry(SEC_ACLE_TYPE_EXPANDED, 1, "x", "a"), b = entry(SEC_ACLE_TYPE_EXPANDED, 1, "x", "b");
-    sec_acle_desc b2 = entry(SEC_ACLE_TYPE_EXPANDED, 7, "X", "B");
-    ASSERT_EQ(sec__add_acle_to_tree(1, &a, &t), 0);
-    ASSERT_EQ(sec__add_acle_to_tree(1, &b, &t), 0);
-    EXPECT_EQ(sec__add_acle_to_tree(1, &b2, &t), ACL_RC_BAD_ACLE);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_EXPANDED, "a", 1, "x") | add(&t, SEC_ACLE_TYPE_EXPANDED, "b", 1, "x"), 0);
+    EXPECT_EQ(add(&t, SEC_ACLE_TYPE_EXPANDED, "B", 7, "X"), ACL_RC_BAD_ACLE);
     EXPECT_NE(rytest::error_text().find("ACLE type: e; mechanism: X; identity: B."), std::string::npos);
-    EXPECT_EQ(sec__add_acle_to_tree(0, &b2, &t), 0);
+    EXPECT_EQ(add(&t, SEC_ACLE_TYPE_EXPANDED, "B", 7, "X", 0), 0);
     r = in_order(t);
     ASSERT_EQ(r.size(), 2u);
     EXPECT_EQ(r[1].id, "b");
@@ -159,9 +149,8 @@ TEST(AclTree, DuplicatesRefusedOrReplacedKeepingTheFirstSpelling) {
 
     for (unsigned char type : {SEC_ACLE_TYPE_ANYOTHER, SEC_ACLE_TYPE_UNAUTHENTICATED, SEC_ACLE_TYPE_GROUP}) {
         t = nullptr;
-        sec_acle_desc x = entry(type, 1, nullptr, "Staff"), y = entry(type, 2, nullptr, "staff");
-        ASSERT_EQ(sec__add_acle_to_tree(1, &x, &t), 0);
-        EXPECT_EQ(sec__add_acle_to_tree(1, &y, &t), ACL_RC_BAD_ACLE);
+        ASSERT_EQ(add(&t, type, "Staff", 1, nullptr), 0);
+        EXPECT_EQ(add(&t, type, "staff", 2, nullptr), ACL_RC_BAD_ACLE);
         if (type == SEC_ACLE_TYPE_GROUP) {
             EXPECT_EQ(rytest::error_msgnum(), 161);
             EXPECT_NE(rytest::error_text().find("ACLE type: g; ACLE identifier: staff."), std::string::npos);
@@ -170,7 +159,7 @@ TEST(AclTree, DuplicatesRefusedOrReplacedKeepingTheFirstSpelling) {
             EXPECT_NE(rytest::error_text().find(type == SEC_ACLE_TYPE_ANYOTHER ? "ACLE type: o." : "ACLE type: n."),
                       std::string::npos);
         }
-        EXPECT_EQ(sec__add_acle_to_tree(0, &y, &t), 0);
+        EXPECT_EQ(add(&t, type, "staff", 2, nullptr, 0), 0);
         EXPECT_EQ(acl__tree_count(t), 1u);
         EXPECT_EQ(in_order(t)[0].perm, 2u);
         sec__free_acltree(t);
@@ -215,14 +204,14 @@ TEST(AclTrees, SlotsByFirstAppearanceAndMechanismWithoutCase) {
 
 TEST(AclTree, MechanismTextIsThatOfTheEarliestEntryStillPresent) {
     sec_acltree_t t = nullptr;
-    sec_acle_desc a = entry(SEC_ACLE_TYPE_USER, 1, "UNIX", "m"), b = entry(SEC_ACLE_TYPE_USER, 1, "unix", "a"),
-                  c = entry(SEC_ACLE_TYPE_USER, 1, "Unix", "z");
-    for (auto *x : {&a, &b, &c}) ASSERT_EQ(sec__add_acle_to_tree(1, x, &t), 0);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "m", 1, "UNIX") | add(&t, SEC_ACLE_TYPE_USER, "a", 1, "unix") |
+                  add(&t, SEC_ACLE_TYPE_USER, "z", 1, "Unix"),
+              0);
     EXPECT_STREQ(acl__tree_mech(t), "UNIX");
     auto r = in_order(t);
     EXPECT_EQ(r[0].mech, "unix");
     EXPECT_EQ(r[2].mech, "Unix");
-    ASSERT_EQ(sec__del_acle_from_tree(&a, t), 0);
+    ASSERT_EQ(del(t, SEC_ACLE_TYPE_USER, "M"), 0);
     EXPECT_STREQ(acl__tree_mech(t), "unix");
     unsigned char *sub = nullptr;
     size_t len = 0;
@@ -231,65 +220,53 @@ TEST(AclTree, MechanismTextIsThatOfTheEarliestEntryStillPresent) {
     EXPECT_EQ(std::string(reinterpret_cast<char *>(sub) + 10), "unix");
     EXPECT_EQ(acl__load_le32(sub + 5), 2u);
     std::free(sub);
-    ASSERT_EQ(sec__del_acle_from_tree(&b, t), 0);
+    ASSERT_EQ(del(t, SEC_ACLE_TYPE_USER, "a"), 0);
     EXPECT_STREQ(acl__tree_mech(t), "Unix");
     sec__free_acltree(t);
 }
 
 TEST(AclTree, DeleteMissingEntriesAndReinsert) {
-    sec_acle_desc u = entry(SEC_ACLE_TYPE_USER, 1, "unix", "alice");
-    EXPECT_EQ(sec__del_acle_from_tree(&u, nullptr), ACL_RC_NO_MATCH);
+    EXPECT_EQ(del(nullptr, SEC_ACLE_TYPE_USER, "alice"), ACL_RC_NO_MATCH);
     EXPECT_EQ(rytest::error_msgnum(), 105);
     EXPECT_NE(rytest::error_text().find("type (4), the mechanism (unix), and the identifier (alice)"),
               std::string::npos);
-
     sec_acltree_t t = nullptr;
-    ASSERT_EQ(sec__add_acle_to_tree(1, &u, &t), 0);
-    sec_acle_desc other = entry(SEC_ACLE_TYPE_USER, 1, "unix", "alicf");
-    EXPECT_EQ(sec__del_acle_from_tree(&other, t), ACL_RC_NO_MATCH);
-    sec_acle_desc upper = entry(SEC_ACLE_TYPE_USER, 9, "unix", "ALICE");
-    EXPECT_EQ(sec__del_acle_from_tree(&upper, t), 0);
-    EXPECT_EQ(acl__tree_count(t), 0u);
-    EXPECT_EQ(sec__del_acle_from_tree(&upper, t), ACL_RC_NO_MATCH);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "alice"), 0);
+    EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "alicf"), ACL_RC_NO_MATCH);
+    EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "ALICE"), 0);
+    EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "ALICE"), ACL_RC_NO_MATCH);
     unsigned char *sub = nullptr;
     size_t len = 1;
     EXPECT_EQ(sec__acltree_to_subacl(t, &sub, &len), 0);
     EXPECT_EQ(sub, nullptr);
     EXPECT_EQ(len, 0u);
-
-    // Grown tree: delete, re-add the same identifier, grow past a rehash.
-    std::vector<std::string> names;
-    for (int i = 0; i < 200; ++i) names.push_back("n" + std::to_string(1000 + i));
-    for (auto &s : names) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", s.c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-    }
-    sec_acle_desc d = entry(SEC_ACLE_TYPE_USER, 0, "unix", "N1100");
-    ASSERT_EQ(sec__del_acle_from_tree(&d, t), 0);
-    sec_acle_desc back = entry(SEC_ACLE_TYPE_USER, 5, "unix", "n1100");
-    ASSERT_EQ(sec__add_acle_to_tree(1, &back, &t), 0);
-    EXPECT_EQ(sec__add_acle_to_tree(1, &back, &t), ACL_RC_BAD_ACLE);
-    for (int i = 0; i < 2000; ++i) {
-        std::string s = "x" + std::to_string(i);
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", s.c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-    }
-    EXPECT_EQ(sec__add_acle_to_tree(1, &back, &t), ACL_RC_BAD_ACLE);
-    ASSERT_EQ(sec__del_acle_from_tree(&back, t), 0);
-    EXPECT_EQ(sec__del_acle_from_tree(&back, t), ACL_RC_NO_MATCH);
-    EXPECT_EQ(acl__tree_count(t), 2199u);
     sec__free_acltree(t);
+
+    // Ascending and descending trees (found without an index), then the
+    // same identifier again and growth past a rehash.
+    for (bool up : {true, false}) {
+        t = nullptr;
+        for (int i = 0; i < 200; ++i) ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "n" + std::to_string(up ? 1000 + i : 1199 - i)), 0);
+        EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "n10999"), ACL_RC_NO_MATCH);
+        ASSERT_EQ(del(t, SEC_ACLE_TYPE_USER, "N1100"), 0);
+        ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "n1100", 5), 0);
+        EXPECT_EQ(add(&t, SEC_ACLE_TYPE_USER, "N1100"), ACL_RC_BAD_ACLE);
+        for (int i = 0; i < 2000; ++i) ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, "x" + std::to_string(i)), 0);
+        EXPECT_EQ(add(&t, SEC_ACLE_TYPE_USER, "n1100"), ACL_RC_BAD_ACLE);
+        EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "n1100"), 0);
+        EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, "n1100"), ACL_RC_NO_MATCH);
+        EXPECT_EQ(acl__tree_count(t), 2199u);
+        EXPECT_EQ(ids(t).front(), "n1000");
+        sec__free_acltree(t);
+    }
 
     // Unauthenticated and anyother: removed whatever the entry carries.
     t = nullptr;
-    sec_acle_desc o = entry(SEC_ACLE_TYPE_ANYOTHER, 1, nullptr, nullptr);
-    sec_acle_desc o2 = entry(SEC_ACLE_TYPE_ANYOTHER, 77, "junk", "someone");
-    ASSERT_EQ(sec__add_acle_to_tree(1, &o, &t), 0);
-    EXPECT_EQ(sec__del_acle_from_tree(&o2, t), 0);
-    EXPECT_EQ(acl__tree_count(t), 0u);
-    EXPECT_EQ(sec__del_acle_from_tree(&o, t), ACL_RC_NO_MATCH);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_ANYOTHER, "", 1, nullptr), 0);
+    EXPECT_EQ(del(t, SEC_ACLE_TYPE_ANYOTHER, "someone", "junk"), 0);
+    EXPECT_EQ(del(t, SEC_ACLE_TYPE_ANYOTHER, nullptr, nullptr), ACL_RC_NO_MATCH);
     EXPECT_NE(rytest::error_text().find("type (2), the mechanism (), and the identifier ()"), std::string::npos);
-    ASSERT_EQ(sec__add_acle_to_tree(1, &o2, &t), 0);
+    ASSERT_EQ(add(&t, SEC_ACLE_TYPE_ANYOTHER, "someone", 77, "junk"), 0);
     EXPECT_EQ(in_order(t)[0].perm, 77u);
     EXPECT_EQ(in_order(t)[0].id, "<null>");
     sec__free_acltree(t);
@@ -303,17 +280,13 @@ TEST(AclTree, MoveToListInOrderSkippingRemoved) {
     EXPECT_EQ(list.count, 0);
 
     sec_acltree_t t = nullptr;
-    for (const char *s : {"carol", "Alice", "bob", "dave"}) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, static_cast<uint32_t>(s[1]), s[0] == 'A' ? "UNIX" : "unix", s);
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-    }
-    sec_acle_desc bob = entry(SEC_ACLE_TYPE_USER, 0, "unix", "bob");
-    ASSERT_EQ(sec__del_acle_from_tree(&bob, t), 0);
+    for (const char *s : {"carol", "Alice", "bob", "dave"})
+        ASSERT_EQ(add(&t, SEC_ACLE_TYPE_USER, s, static_cast<uint32_t>(s[1]), s[0] == 'A' ? "UNIX" : "unix"), 0);
+    ASSERT_EQ(del(t, SEC_ACLE_TYPE_USER, "bob"), 0);
     ASSERT_EQ(sec__acltree_to_aclelist(t, &list), 0);
     EXPECT_EQ(acl__tree_count(t), 0u);
-    sec_acle_desc g = entry(SEC_ACLE_TYPE_GROUP, 4, nullptr, "wheel");
     sec_acltree_t gt = nullptr;
-    ASSERT_EQ(sec__add_acle_to_tree(1, &g, &gt), 0);
+    ASSERT_EQ(add(&gt, SEC_ACLE_TYPE_GROUP, "wheel", 4, nullptr), 0);
     ASSERT_EQ(sec__acltree_to_aclelist(gt, &list), 0);
     ASSERT_EQ(list.count, 4);
     const char *want[] = {"Alice", "carol", "dave", "wheel"};
@@ -351,23 +324,30 @@ TEST(AclTree, MemoryFailuresLeaveNothingBehind) {
         });
     EXPECT_GT(sites, 10);
 
-    // A failed insertion leaves the tree as it was.
+    // A failed insertion leaves the tree as it was: the entries before it
+    // are all there, the failing one is not.
     sec_acltree_t t = nullptr;
-    for (int i = 0; i < 20; ++i) {
-        sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", names[i].c_str());
-        ASSERT_EQ(sec__add_acle_to_tree(1, &e, &t), 0);
-    }
-    std::vector<std::string> before = ids(t);
-    sec_acle_desc more = entry(SEC_ACLE_TYPE_USER, 1, "unix", "a-new");
-    for (long nth = 1; nth < 5; ++nth) {
-        rytest::alloc_fail_nth(nth);
-        int32_t rc = sec__add_acle_to_tree(1, &more, &t);
-        long reached = rytest::alloc_count();
-        rytest::alloc_fail_none();
-        if (reached < nth) break;
-        EXPECT_EQ(rc, ACL_RC_NO_MEMORY);
-        EXPECT_EQ(ids(t), before);
-    }
+    int added = 0;
+    rytest::for_each_alloc_failure(
+        [&] {
+            int32_t rc = 0;
+            for (added = 0; added < 60 && !(rc = add(&t, SEC_ACLE_TYPE_USER, "new" + std::to_string(added))); ++added) {
+            }
+            return rc;
+        },
+        [&](int32_t rc, long) {
+            EXPECT_EQ(rc, ACL_RC_NO_MEMORY);
+            EXPECT_EQ(acl__tree_count(t), 20u + static_cast<size_t>(added));
+            EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, ("new" + std::to_string(added)).c_str()), ACL_RC_NO_MATCH);
+            if (added) {
+                EXPECT_EQ(del(t, SEC_ACLE_TYPE_USER, ("new" + std::to_string(added - 1)).c_str()), 0);
+            }
+        },
+        [&] {
+            sec__free_acltree(t);
+            t = nullptr;
+            for (int i = 0; i < 20; ++i) EXPECT_EQ(add(&t, SEC_ACLE_TYPE_USER, names[i]), 0);
+        });
     sec__free_acltree(t);
 
     // Moving to a list: what was moved stays in the list and is released
@@ -391,11 +371,7 @@ TEST(AclTree, MemoryFailuresLeaveNothingBehind) {
         },
         [&] {
             cleanup();
-            for (int i = 0; i < 12; ++i) {
-                std::string s = "u" + std::to_string(20 - i);
-                sec_acle_desc e = entry(SEC_ACLE_TYPE_USER, 1, "unix", s.c_str());
-                EXPECT_EQ(sec__add_acle_to_tree(1, &e, &u), 0);
-            }
+            for (int i = 0; i < 12; ++i) EXPECT_EQ(add(&u, SEC_ACLE_TYPE_USER, "u" + std::to_string(20 - i)), 0);
         });
     EXPECT_EQ(list.count, 12);
     cleanup();

@@ -701,7 +701,7 @@ bool entry_parts(const sec_acle_desc *acle, new_entry *ne) {
 // ---- The array of trees ---------------------------------------------------------
 
 struct trees_index {
-    uint32_t *slots;  // tree slot + 1, 0 free
+    uint64_t *slots;  // key hash (upper half), tree slot + 1 (lower half); 0 free
     uint32_t mask;
     uint32_t used;
     size_t cap;   // capacity of the trees array
@@ -718,11 +718,10 @@ bool tree_matches(const tree *t, unsigned char type, const char *mech, size_t me
     return t->mechlen == mechlen && fold_eq(inline_bytes(t), mech, mechlen);
 }
 
-void index_put(trees_index *x, sec_acltree_t *trees, int32_t slot) {
-    const tree *t = trees[slot];
-    size_t s = slot_of(tree_key_hash(t->type, inline_bytes(t), t->mechlen), x->mask);
+void index_put(trees_index *x, uint64_t v) {
+    size_t s = slot_of(slot_hash(v), x->mask);
     while (x->slots[s]) s = (s + 1) & x->mask;
-    x->slots[s] = static_cast<uint32_t>(slot) + 1;
+    x->slots[s] = v;
 }
 
 // Make the index hold every tree of the array plus `more`, at most half
@@ -734,15 +733,22 @@ int32_t index_room(trees_index *x, acl__trees_s *trees, size_t more) {
     if (!x->slots) need = static_cast<size_t>(trees->nooftrees) + more;
     size_t ns = slots ? slots : 16;
     while (ns / 2 < need) ns *= 2;
-    auto *nsl = static_cast<uint32_t *>(acl__calloc(ns, sizeof(uint32_t)));
-    if (!nsl) return no_memory("sec__add_acle_to_trees", ns * sizeof(uint32_t));
-    std::free(x->slots);
+    auto *nsl = static_cast<uint64_t *>(acl__calloc(ns, sizeof(uint64_t)));
+    if (!nsl) return no_memory("sec__add_acle_to_trees", ns * sizeof(uint64_t));
+    acl__advise_large(nsl, ns * sizeof(uint64_t));
+    uint64_t *old = x->slots;
     x->slots = nsl;
     x->mask = static_cast<uint32_t>(ns - 1);
+    if (old) {
+        for (size_t s = 0; s < slots; ++s)
+            if (old[s]) index_put(x, old[s]);
+        std::free(old);
+        return 0;
+    }
     x->used = 0;
     for (int32_t s = 0; s < trees->nooftrees; ++s)
-        if (trees->trees[s]) {
-            index_put(x, trees->trees, s);
+        if (const tree *t = trees->trees[s]) {
+            index_put(x, slot_value(tree_key_hash(t->type, inline_bytes(t), t->mechlen), static_cast<uint32_t>(s)));
             ++x->used;
         }
     return 0;
@@ -830,7 +836,8 @@ int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
     const uint32_t h = tree_key_hash(ne.type, ne.mech, ne.mechlen);
     if (x->slots) {
         for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask) {
-            int32_t slot = static_cast<int32_t>(x->slots[s] - 1);
+            if (slot_hash(x->slots[s]) != h) continue;
+            int32_t slot = static_cast<int32_t>(slot_entry(x->slots[s]));
             if (tree_matches(trees->trees[slot], ne.type, ne.mech, ne.mechlen)) {
                 x->last = slot;
                 return insert(1, ne, &trees->trees[slot]);
@@ -849,6 +856,7 @@ int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
         if (!na) return no_memory(fname, nc * sizeof(sec_acltree_t));
         trees->trees = static_cast<sec_acltree_t *>(na);
         x->cap = nc;
+        acl__advise_large(na, nc * sizeof(sec_acltree_t));
     }
     const int32_t slot = trees->nooftrees++;
     trees->trees[slot] = nullptr;
@@ -856,7 +864,7 @@ int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
     // empty, and out of the index.
     int32_t rc = insert(1, ne, &trees->trees[slot]);
     if (rc) return rc;
-    index_put(x, trees->trees, slot);
+    index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
     ++x->used;
     x->last = slot;
     return 0;
