@@ -16,15 +16,13 @@ set(CPACK_PACKAGE_VERSION ${PROJECT_VERSION})
 set(CPACK_PACKAGE_VENDOR "ryacl developers")
 set(CPACK_PACKAGE_CONTACT "ryacl developers <dev@ryacl.local>")
 set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "ACL file checker, query command and ACL library")
-set(CPACK_DEBIAN_PACKAGE_DESCRIPTION
-  "ACL file checker, query command and ACL library\n"
-  "ryaclfck checks access control list files for services before they are\n"
-  "put to use and caches their compiled form; ryaclq shows what an ACL\n"
-  "grants to a client.  libryacl reads ACL files into compiled ACLs, edits\n"
-  "and lists them and evaluates permissions.  Includes the headers, the\n"
-  "static library, pkg-config and CMake files, the message catalog and the\n"
-  "manual pages.")
-string(REPLACE ";" "" CPACK_DEBIAN_PACKAGE_DESCRIPTION "${CPACK_DEBIAN_PACKAGE_DESCRIPTION}")
+# The extended description; CPack puts the summary above it.
+set(CPACK_DEBIAN_PACKAGE_DESCRIPTION "ryaclfck checks access control list files for services before they are
+put to use, and caches their compiled form. ryaclq shows what an ACL
+grants to a client. libryacl reads ACL files into compiled ACLs, edits
+and lists them and evaluates permissions. Includes the headers, the
+static library, pkg-config and CMake files, the message catalog and the
+manual pages.")
 set(CPACK_DEBIAN_PACKAGE_SECTION admin)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
@@ -32,9 +30,11 @@ set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 # the installation is relative (the .pc file, the CMake package, ryaclq's
 # $ORIGIN run path), so the package works from there as from a staging root.
 set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
+# Shipped binaries carry no debug information.
+set(CPACK_STRIP_FILES ON)
 set(CPACK_DEBIAN_PACKAGE_CONTROL_STRICT_PERMISSION ON)
-# An shlibs file for packages that link libryacl.so.1, and ldconfig
-# triggers for the library.
+# An shlibs file for packages that link libryacl.so.1, and ldconfig runs
+# in postinst and postrm.
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS ON)
 set(CPACK_DEBIAN_PACKAGE_GENERATE_SHLIBS_POLICY ">=")
 find_program(RYACL_DPKG_SHLIBDEPS dpkg-shlibdeps)
