@@ -24,7 +24,7 @@ extra=$(ls "$prefix/include" | grep -v -x -e ryacl.h -e ry_zo.h || true)
 
 # Exactly the public operations are exported.
 exported=$(nm -D --defined-only "$libdir/libryacl.so" | awk '$2 ~ /^[TDBRV]$/ {print $3}' | sort)
-unexpected=$(echo "$exported" | grep -v -E '^(sec_[a-z_]+|sec__register_id_handler|sec__single_acle_perm|sec__group_acles_perm|acl__trace_unregister_component|zo_[a-z_]+_1)$' || true)
+unexpected=$(echo "$exported" | grep -v -E '^(sec_[a-z0-9_]+|sec__register_id_handler|sec__single_acle_perm|sec__group_acles_perm|acl__trace_unregister_component|zo_[a-z_]+_1)$' || true)
 [ -z "$unexpected" ] || fail "unexpected exports: $(echo $unexpected)"
 for sym in sec_create_acle sec_display_acle_id sec_release_acle sec_translate_perms sec_translate_bitmask \
            sec_read_acl_file sec_read_acl_from_data sec_create_empty_acl sec_convert_acl_to_host sec_release_acl \
