@@ -73,17 +73,22 @@ void ensure_registered() {
     pthread_once(&acl__trace_register_once, register_once);
 }
 
-item str(const char *s, const char *absent) {
-    if (!s) s = absent ? absent : "";
-    return item{s, std::strlen(s) + 1};
-}
-
 item strn(const char *s, size_t max, const char *absent) {
-    if (!s) return str(absent ? absent : "");
+    if (!s) {
+        s = absent ? absent : "";
+        return item{s, std::strlen(s) + 1};
+    }
     const void *nul = std::memchr(s, '\0', max);
     size_t n = nul ? static_cast<size_t>(static_cast<const char *>(nul) - s) + 1 : max;
     return item{s, n};
 }
+
+namespace {
+tr_item_t to_tr(const item &i) {
+    if (i.n == kTextToMeasure) return tr_item_t{i.p, std::strlen(static_cast<const char *>(i.p)) + 1};
+    return tr_item_t{i.p, i.n};
+}
+}  // namespace
 
 void record_id(uint32_t id) { tr_record_id_1(kComponent, id); }
 
@@ -94,18 +99,18 @@ void record_data(uint32_t id, std::initializer_list<item> items) {
     uint32_t n = 0;
     for (const item &i : items) {
         if (n == sizeof v / sizeof v[0]) break;
-        v[n++] = tr_item_t{i.p, i.n};
+        v[n++] = to_tr(i);
     }
     tr_record_datav_1(kComponent, id, n, v);
 }
 
-void api_entry(uint32_t id, uint32_t data_id, std::initializer_list<item> data) {
+void api_entry_on(uint32_t id, uint32_t data_id, std::initializer_list<item> data) {
     tr_detail_level_t lv = level(API);
     if (lv == 1) record_id(id);
     else if (lv >= 8) record_data(data_id, data);
 }
 
-void api_exit(uint32_t id, uint32_t rc_id, int32_t rc) {
+void api_exit_on(uint32_t id, uint32_t rc_id, int32_t rc) {
     tr_detail_level_t lv = level(API);
     if (lv == 1) record_id(id);
     else if (lv >= 8) record_data(rc_id, {val(rc)});
@@ -126,7 +131,7 @@ void api_exit(uint32_t id, uint32_t rc_id, uint32_t result_id, int32_t rc,
         v[n++] = tr_item_t{&rc, sizeof rc};
         for (const item &i : results) {
             if (n == sizeof v / sizeof v[0]) break;
-            v[n++] = tr_item_t{i.p, i.n};
+            v[n++] = to_tr(i);
         }
         tr_record_datav_1(kComponent, result_id, n, v);
     }
@@ -136,7 +141,7 @@ void api_release_exit(uint32_t id) {
     if (level(API) != 0) record_id(id);
 }
 
-void point(category c, uint32_t id, std::initializer_list<item> data) {
+void point_on(category c, uint32_t id, std::initializer_list<item> data) {
     tr_detail_level_t lv = level(c);
     if (lv == 0) return;
     // Two Info points have levels of their own: 107 (cache file in use) only
@@ -177,7 +182,7 @@ void perf_timer::record(uint32_t id, std::initializer_list<item> prefix) {
     uint32_t n = 0;
     for (const item &i : prefix) {
         if (n == sizeof v / sizeof v[0] - 3) break;
-        v[n++] = tr_item_t{i.p, i.n};
+        v[n++] = to_tr(i);
     }
     v[n++] = tr_item_t{&ticks, sizeof ticks};
     v[n++] = tr_item_t{&sec, sizeof sec};

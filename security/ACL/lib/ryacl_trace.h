@@ -36,7 +36,12 @@ struct item {
     size_t n;
 };
 // A text with its NUL; a null text is recorded as `absent` ("" by default).
-item str(const char *s, const char *absent = "");
+// A terminated text is measured only when a point is recorded, so a trace
+// point that is off never walks its texts.
+inline constexpr size_t kTextToMeasure = static_cast<size_t>(-1);
+inline item str(const char *s, const char *absent = "") {
+    return item{s ? s : (absent ? absent : ""), kTextToMeasure};
+}
 // A text read from an area of `max` bytes that need not hold a NUL: never
 // reads past the area.  Unterminated, it is recorded as raw bytes.
 item strn(const char *s, size_t max, const char *absent = "");
@@ -50,15 +55,24 @@ void record_data(uint32_t id, std::initializer_list<item> items);
 // `data_id` with the data.  Exit: level 1 records `id`, level 8 records
 // `rc_id` with the return code, or, on success when results are given,
 // `result_id` with the return code and the results.
-void api_entry(uint32_t id, uint32_t data_id, std::initializer_list<item> data);
-void api_exit(uint32_t id, uint32_t rc_id, int32_t rc);
+void api_entry_on(uint32_t id, uint32_t data_id, std::initializer_list<item> data);
+inline void api_entry(uint32_t id, uint32_t data_id, std::initializer_list<item> data) {
+    if (level(API)) api_entry_on(id, data_id, data);
+}
+void api_exit_on(uint32_t id, uint32_t rc_id, int32_t rc);
+inline void api_exit(uint32_t id, uint32_t rc_id, int32_t rc) {
+    if (level(API)) api_exit_on(id, rc_id, rc);
+}
 void api_exit(uint32_t id, uint32_t rc_id, uint32_t result_id, int32_t rc,
               std::initializer_list<item> results);
 // Exit of the three release operations: recorded at every non-zero level.
 void api_release_exit(uint32_t id);
 
 // "Errors" and "Info" points: recorded when the category's level is non-zero.
-void point(category c, uint32_t id, std::initializer_list<item> data);
+void point_on(category c, uint32_t id, std::initializer_list<item> data);
+inline void point(category c, uint32_t id, std::initializer_list<item> data) {
+    if (level(c)) point_on(c, id, data);
+}
 
 // Elapsed-time record of the "Perf" category.  Armed when the Perf level
 // equals `perf_level` at construction; record() adds the elapsed counter
