@@ -57,6 +57,10 @@ struct cache_writer {
     char caclfname[ACL_FNAME_AREA];
     char tmpname[ACL_FNAME_AREA];
     struct stat acl_st {};
+    // The ACL file's directory, and where the base name starts in each of
+    // the three names: every file operation is relative to this descriptor.
+    int dirfd = -1;
+    size_t base = 0;
     int cachefd = -1;  // existing cache, opened for writing, never written
     int tmpfd = -1;
     bool tmp_created = false;
@@ -86,7 +90,7 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
     // a device or FIFO; with O_NOFOLLOW a link gives a descriptor of the
     // link itself.
     acl__file_step("cache:open", caclfname);
-    int pfd = open(caclfname, O_PATH | O_NOFOLLOW | O_CLOEXEC);
+    int pfd = openat(dirfd, caclfname + base, O_PATH | O_NOFOLLOW | O_CLOEXEC);
     if (pfd < 0) {
         int err = errno;
         if (err != ENOENT) {
@@ -122,7 +126,7 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
         if (!force && acl_st.st_mtim.tv_sec < cst.st_mtim.tv_sec) return ACL_RC_INFO;
 
         acl__file_step("cache:open-write", caclfname);
-        cachefd = open(caclfname, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+        cachefd = openat(dirfd, caclfname + base, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
         struct stat wst {};
         if (cachefd < 0 || fstat(cachefd, &wst) != 0 || wst.st_dev != cst.st_dev || wst.st_ino != cst.st_ino)
             return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
@@ -141,7 +145,7 @@ int32_t cache_writer::create_tmp() {
         std::snprintf(tmpname + pos, 5, "%04x", static_cast<unsigned>(random16()));
         pos += 4;
         acl__file_step("cache:open-tmp", tmpname);
-        tmpfd = open(tmpname, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0);
+        tmpfd = openat(dirfd, tmpname + base, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0);
         if (tmpfd >= 0) {
             tmp_created = true;
             return 0;
@@ -195,7 +199,8 @@ int32_t cache_writer::fill_tmp() {
     if (crc != 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, errno);
 
     acl__file_step("cache:rename", tmpname);
-    if (rename(tmpname, caclfname) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 163, tmpname, caclfname);
+    if (renameat(dirfd, tmpname + base, dirfd, caclfname + base) != 0)
+        return acl::set_error(ACL_RC_FILE_ERROR, 163, tmpname, caclfname);
     tmp_created = false;
     return 0;
 }
@@ -205,9 +210,10 @@ void cache_writer::cleanup(int32_t rc) {
     if (tmpfd >= 0) close(tmpfd);
     if (rc != 0 && tmp_created) {
         acl__file_step("cache:unlink", tmpname);
-        unlink(tmpname);
+        unlinkat(dirfd, tmpname + base, 0);
     }
     if (cachefd >= 0) close(cachefd);
+    if (dirfd >= 0) close(dirfd);
 }
 
 }  // namespace
@@ -235,14 +241,31 @@ int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *ac
     std::memcpy(w.caclfname, aclfname, nlen);
     std::memcpy(w.caclfname + nlen, ACL_CACHE_SUFFIX, sizeof ACL_CACHE_SUFFIX);
 
-    acl__file_step("cache:stat-acl", aclfname);
-    if (stat(aclfname, &w.acl_st) != 0) {
-        int err = errno;
+    // The directory is opened once and every name taken relative to it: a
+    // directory moved or replaced while the cache is written then cannot
+    // split the work between two directories, leaving the temporary file
+    // where the rename and its removal no longer look.  The ACL file is
+    // still looked up through links, as by name.
+    const char *slash = std::strrchr(aclfname, '/');
+    w.base = slash ? static_cast<size_t>(slash - aclfname) + 1 : 0;
+    char dirname[ACL_FNAME_AREA] = ".";
+    if (w.base) {
+        std::memcpy(dirname, aclfname, w.base);
+        dirname[w.base] = '\0';
+    }
+    int32_t rc = 0;
+    w.dirfd = open(dirname, O_PATH | O_DIRECTORY | O_CLOEXEC);
+    int err = errno;
+    if (w.dirfd >= 0) {
+        acl__file_step("cache:stat-acl", aclfname);
+        err = fstatat(w.dirfd, aclfname + w.base, &w.acl_st, 0) != 0 ? errno : 0;
+    }
+    if (w.dirfd < 0 || err) {
         tr::point(tr::ERRORS, 109, {tr::str(aclfname), tr::str("stat()"), tr::val(err)});
-        return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+        rc = acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
     }
 
-    int32_t rc = w.check_existing(force);
+    if (rc == 0) rc = w.check_existing(force);
     if (rc == 0) rc = w.create_tmp();
     if (rc == 0) rc = w.fill_tmp();
     w.cleanup(rc);
