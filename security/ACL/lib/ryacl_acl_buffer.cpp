@@ -229,7 +229,7 @@ int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree
             size_t rest = bound > pos ? bound - pos : 0;
             size_t more = rest / (ACL_ENTRY_HDR_SIZE + (with_id ? 1 : 0));
             if (more > count - 1) more = count - 1;
-            rc = acl__tree_reserve(t, more, rest);
+            rc = acl__tree_reserve(&t, more, rest);
             if (rc) break;
         }
     }

@@ -34,17 +34,16 @@ struct sec_acltree_s {
         uint32_t id_off;  // identifier (NUL-terminated) in the arena
         uint32_t id_len;
         uint32_t perm;
-        uint32_t flags;
+        uint32_t flags;  // kPresent, kOwnMech; above them the folded identifier's hash
     };
     struct big_part {
         ent *ents;
         char *arena;
-        // Slot = entry index + 1, 0 free.  Built only once the identifiers
-        // stop arriving in one direction (or one must be looked up): until
-        // then a duplicate could only be the previous entry.
         // A slot holds the identifier's hash (upper half) and its entry's
-        // index + 1 (lower half); 0 is free.  A probe for a new identifier
-        // thus touches the index alone.
+        // index + 1 (lower half); 0 is free, and a probe for a new
+        // identifier touches the index alone.  Built only once the
+        // identifiers stop arriving in one direction in a tree too large to
+        // scan: until then a duplicate could only be the previous entry.
         uint64_t *idx;
         uint32_t n, cap;
         uint32_t arena_len, arena_cap;
@@ -55,13 +54,17 @@ struct sec_acltree_s {
         bool descending;       // every entry so far descends strictly
     };
 
-    big_part *big;  // null while the tree holds only the entry it was created with
-    ent e0;         // that entry, while big is null
+    // Null while the tree holds only the entry it was created with; then
+    // it points just behind this header, in the same block, so an
+    // insertion reaches the tree's counters without another miss.
+    big_part *big;
+    ent e0;  // that entry, while big is null
     unsigned char type;
     unsigned char mechlen;  // length of mech0
-    // Followed in the same block by mech0 (the first entry's mechanism
-    // spelling, "" for types without one) and its NUL, then, while big is
-    // null, the first entry's identifier and its NUL.
+    // Followed in the same block by the big_part (once there is one), then
+    // mech0 (the first entry's mechanism spelling, "" for types without
+    // one) and its NUL, then, while big is null, the first entry's
+    // identifier and its NUL.
 };
 
 namespace {
@@ -72,10 +75,18 @@ using big_part = sec_acltree_s::big_part;
 
 constexpr uint32_t kPresent = 1u;
 constexpr uint32_t kOwnMech = 2u;  // mechanism spelling stored just before the identifier
+constexpr uint32_t kHashMask = ~3u;
+// An unordered tree of up to this many entries finds duplicates by
+// scanning its entries' hashes; beyond it an index pays.
+constexpr uint32_t kScanMax = 16;
 constexpr size_t kMechMax = 16;
 
-char *inline_bytes(tree *t) { return reinterpret_cast<char *>(t) + sizeof(tree); }
-const char *inline_bytes(const tree *t) { return reinterpret_cast<const char *>(t) + sizeof(tree); }
+char *inline_bytes(tree *t) {
+    return reinterpret_cast<char *>(t) + sizeof(tree) + (t->big ? sizeof(big_part) : 0);
+}
+const char *inline_bytes(const tree *t) {
+    return reinterpret_cast<const char *>(t) + sizeof(tree) + (t->big ? sizeof(big_part) : 0);
+}
 
 int32_t size_arg(size_t n) { return n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n); }
 
@@ -475,7 +486,7 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
     b->idx_used = 0;
     for (uint32_t i = b->n; i-- > 0;) {
         const ent &e = b->ents[i];
-        const uint32_t h = fold_hash(b->arena + e.id_off, e.id_len);
+        const uint32_t h = e.flags & kHashMask;
         bool found = false;
         size_t s = find_slot(b, h, b->arena + e.id_off, e.id_len, &found);
         if (found) continue;
@@ -485,41 +496,52 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
     return true;
 }
 
+// The arrays of the growable form; the big_part itself lives in the tree's
+// block.
 void free_big(big_part *b) {
     if (!b) return;
     std::free(b->ents);
     std::free(b->arena);
     std::free(b->idx);
-    std::free(b);
 }
 
 // Move a one-entry tree to the growable form, with room for `more` further
-// entries and `bytes` further arena bytes.
-int32_t promote(tree *t, size_t more, size_t bytes) {
+// entries and `bytes` further arena bytes.  The block is reallocated, so
+// the link to the tree is updated.
+int32_t promote(tree **node, size_t more, size_t bytes) {
+    static_assert(sizeof(tree) % alignof(big_part) == 0, "big_part follows the header");
     const char *fname = "sec__add_acle_to_tree";
+    tree *t = *node;
     const size_t inl = t->e0.id_off + size_t{t->e0.id_len} + 1;
+    const size_t keep = t->mechlen + 1u;
     size_t failed = 0;
-    auto *b = static_cast<big_part *>(acl__calloc(1, sizeof(big_part)));
-    if (!b) return no_memory(fname, sizeof(big_part));
-    bool ok = grow_array(reinterpret_cast<void **>(&b->ents), &b->cap, more > UINT32_MAX ? UINT32_MAX : 1 + more,
+    big_part nb{};
+    bool ok = grow_array(reinterpret_cast<void **>(&nb.ents), &nb.cap, more >= UINT32_MAX ? UINT32_MAX : 1 + more,
                          sizeof(ent), &failed);
     size_t want = inl + bytes < 64 ? 64 : inl + bytes;
-    if (ok) ok = grow_array(reinterpret_cast<void **>(&b->arena), &b->arena_cap,
+    if (ok) ok = grow_array(reinterpret_cast<void **>(&nb.arena), &nb.arena_cap,
                             want > UINT32_MAX ? UINT32_MAX : want, 1, &failed);
+    tree *nt = nullptr;
     if (ok) {
-        std::memcpy(b->arena, inline_bytes(t), inl);
-        b->arena_len = static_cast<uint32_t>(inl);
-        b->ents[0] = t->e0;
-        b->n = 1;
-        b->n_present = (t->e0.flags & kPresent) ? 1 : 0;
-        b->sorted_upto = 1;
-        b->descending = true;
+        std::memcpy(nb.arena, inline_bytes(t), inl);
+        nt = static_cast<tree *>(acl__realloc(t, sizeof(tree) + sizeof(big_part) + keep));
+        if (!nt) failed = sizeof(tree) + sizeof(big_part) + keep;
     }
-    if (!ok) {
-        free_big(b);
+    if (!nt) {
+        free_big(&nb);
         return no_memory(fname, failed);
     }
-    t->big = b;
+    char *base = reinterpret_cast<char *>(nt) + sizeof(tree);
+    std::memmove(base + sizeof(big_part), base, keep);  // mech0 moves behind the big_part
+    nb.arena_len = static_cast<uint32_t>(inl);
+    nb.ents[0] = nt->e0;
+    nb.n = 1;
+    nb.n_present = (nt->e0.flags & kPresent) ? 1 : 0;
+    nb.sorted_upto = 1;
+    nb.descending = true;
+    nt->big = reinterpret_cast<big_part *>(base);
+    std::memcpy(static_cast<void *>(nt->big), &nb, sizeof nb);
+    *node = nt;
     return 0;
 }
 
@@ -546,7 +568,7 @@ struct new_entry {
     mutable uint32_t hash = 0;
     mutable bool hashed = false;
     uint32_t h() const {
-        if (!hashed) hash = fold_hash(id, idlen), hashed = true;
+        if (!hashed) hash = fold_hash(id, idlen) & kHashMask, hashed = true;
         return hash;
     }
 };
@@ -586,13 +608,28 @@ int32_t create(const new_entry &ne, tree **node) {
     p[mechlen] = '\0';
     std::memcpy(p + mechlen + 1, ne.id, ne.idlen);
     p[mechlen + 1 + ne.idlen] = '\0';
-    t->e0 = ent{static_cast<uint32_t>(mechlen + 1), static_cast<uint32_t>(ne.idlen), ne.perm, kPresent};
+    t->e0 = ent{static_cast<uint32_t>(mechlen + 1), static_cast<uint32_t>(ne.idlen), ne.perm,
+                (has_id(ne.type) ? ne.h() : 0) | kPresent};
     *node = t;
     return 0;
 }
 
 size_t probe(const big_part *b, const new_entry &ne, bool *found) {
     return find_slot(b, ne.h(), ne.id, ne.idlen, found);
+}
+
+bool ordered(const big_part *b) { return b->sorted_upto == b->n || b->descending; }
+
+// The present entry of the identifier in a small unordered tree, or null.
+ent *scan(big_part *b, const new_entry &ne) {
+    const uint32_t h = ne.h();
+    for (uint32_t j = 0; j < b->n; ++j) {
+        ent &e = b->ents[j];
+        if ((e.flags & (kHashMask | kPresent)) == (h | kPresent) && e.id_len == ne.idlen &&
+            fold_eq(b->arena + e.id_off, ne.id, ne.idlen))
+            return &e;
+    }
+    return nullptr;
 }
 
 // Where the identifiers arrive in one direction, binary search finds an
@@ -624,7 +661,8 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
             return duplicate(single, ne, t->e0);
-        if (int32_t rc = promote(t, 1, ne.idlen + 1 + ne.mechlen + 1)) return rc;
+        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1)) return rc;
+        t = *node;
     }
     big_part *b = t->big;
     const uint32_t i = b->n;
@@ -636,9 +674,17 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
         uint32_t f = first_present(t);
         if (f < b->n) return duplicate(single, ne, b->ents[f]);
     } else {
-        last_cmp = zo_strcasecmp_posix_1(b->arena + b->ents[i - 1].id_off, ne.id);
+        // Once neither direction holds the comparison tells nothing more.
+        if (b->sorted_upto == i || b->descending)
+            last_cmp = zo_strcasecmp_posix_1(b->arena + b->ents[i - 1].id_off, ne.id);
         const bool in_run = (last_cmp < 0 && b->sorted_upto == i) || (last_cmp > 0 && b->descending);
-        if (!b->idx && !in_run && !grow_index(b, size_t{i} + 1, &failed)) return no_memory(fname, failed);
+        if (!b->idx && !in_run) {
+            if (i > kScanMax) {
+                if (!grow_index(b, size_t{i} + 1, &failed)) return no_memory(fname, failed);
+            } else if (ent *d = scan(b, ne)) {
+                return duplicate(single, ne, *d);
+            }
+        }
         if (b->idx) {
             slot = probe(b, ne, &found);
             if (found && (b->ents[slot_entry(b->idx[slot])].flags & kPresent))
@@ -669,7 +715,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     std::memcpy(p, ne.id, ne.idlen);
     p[ne.idlen] = '\0';
     b->ents[i] = ent{static_cast<uint32_t>(p - b->arena), static_cast<uint32_t>(ne.idlen), ne.perm,
-                     kPresent | (own ? kOwnMech : 0)};
+                     ne.h() | kPresent | (own ? kOwnMech : 0)};
     b->arena_len += static_cast<uint32_t>(add);
     if (b->idx) {
         if (!found) ++b->idx_used;
@@ -795,9 +841,10 @@ int32_t acl__tree_insert(sec_acltree_t *node, sec_boolean_t single, unsigned cha
     return insert(single, ne, node);
 }
 
-int32_t acl__tree_reserve(sec_acltree_t t, size_t entries, size_t bytes) {
+int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
+    sec_acltree_t t = node ? *node : nullptr;
     if (!t) return 0;
-    if (!t->big) return promote(t, entries, bytes);
+    if (!t->big) return promote(node, entries, bytes);
     big_part *b = t->big;
     size_t failed = 0;
     size_t ne = size_t{b->n} + entries, nb = size_t{b->arena_len} + bytes;
@@ -917,8 +964,10 @@ int32_t sec__del_acle_from_tree(const sec_acle_desc *acle, sec_acltree_t t) {
         bool found = false;
         size_t s = probe(b, ne, &found);
         if (found) at = slot_entry(b->idx[s]);
-    } else {
+    } else if (ordered(b)) {
         at = find_ordered(b, ne.id);
+    } else if (ent *e = scan(b, ne)) {
+        at = static_cast<uint32_t>(e - b->ents);
     }
     if (at >= b->n || !(b->ents[at].flags & kPresent)) return not_found();
     mark_removed(t, b->ents[at]);

@@ -74,7 +74,8 @@ int32_t acl__tree_insert(sec_acltree_t *node, sec_boolean_t single, unsigned cha
                          const char *mech, size_t mechlen, const char *id, size_t idlen);
 // Make room for `entries` more entries and `bytes` more identifier bytes,
 // so that a tree whose size is known grows once.  0, or 6 (message 89).
-int32_t acl__tree_reserve(sec_acltree_t tree, size_t entries, size_t bytes);
+// The tree may move: *tree is updated.
+int32_t acl__tree_reserve(sec_acltree_t *tree, size_t entries, size_t bytes);
 // Without ordering anything: the number of present entries, the sum of
 // their identifier lengths and the longest one.
 void acl__tree_stats(const sec_acltree_s *tree, size_t *count, uint64_t *id_bytes, size_t *max_idlen);
