@@ -150,6 +150,20 @@ int32_t reader::read_text() {
     acl__file_step("read:open", aclfname);
     int fd = open(aclfname, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
     if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, aclfname, errno);
+    // Only the file whose type, owner and mode were checked is read: the
+    // name may have come to denote another since (a link to a file the
+    // caller never vetted, a FIFO, a device, a huge file).  The change time
+    // tells a new file that reuses the inode number of a deleted one, and
+    // one changed since the look.  Such a swap fails no call, so it is
+    // reported with errno 0, like a file that is not regular.
+    struct stat fst;
+    const int frc = fstat(fd, &fst);
+    const int err = frc != 0 ? errno : 0;
+    if (frc != 0 || !same_file(fst, acl_st) || fst.st_ctim.tv_sec != acl_st.st_ctim.tv_sec ||
+        fst.st_ctim.tv_nsec != acl_st.st_ctim.tv_nsec) {
+        close(fd);
+        return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+    }
     tr::point(tr::INFO, 119, {tr::str(aclfname)});
     tr::perf_timer step(2);
     int32_t rc = acl__lock_acl_file(aclfname, fd, 1);
