@@ -14,6 +14,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cstdio>
 #include <cstdlib>
@@ -72,8 +73,14 @@ struct CrashConsistency : ::testing::Test {
     const std::string old_acl = big_acl(20000, 1), new_acl = big_acl(20000, 2);
     const std::regex temporary{"svc\\.acl\\.([0-9a-f]{4})+"};
 
+    std::string text_acl;
+
     void SetUp() override {
         rytest::write_file(acl, text, 0640);
+        sec_buffer_desc t{0, nullptr};
+        ASSERT_EQ(sec_read_acl_file(acl.c_str(), nullptr, nullptr, SEC_ACLF_FROM_TEXT, &t, nullptr), 0);
+        text_acl.assign(static_cast<char *>(t.value), static_cast<size_t>(t.length));
+        sec_release_acl(&t);
         ASSERT_NE(old_acl, new_acl);
         ASSERT_GT(new_acl.size(), 300000u);
     }
@@ -105,18 +112,18 @@ struct CrashConsistency : ::testing::Test {
         EXPECT_LE(debris, 1) << what;
         return debris;
     }
-    // What a reader gets: 1 old, 2 new, 0 anything else.
+    // What a reader gets: 1 the old cache, 2 the new one, 3 the text
+    // compiled (a cache replaced between its look and its open is passed
+    // over), 0 anything else.
     int read_once() {
         sec_buffer_desc got{0, nullptr};
         uint32_t rflags = 0;
         int32_t rc = sec_read_acl_file(acl.c_str(), nullptr, nullptr, SEC_ACLF_CONVERT_CACHE, &got, &rflags);
-        int which = 0;
-        if (rc == 0 && rflags == SEC_ACLF_CONVERT_CACHE) {
-            const std::string g(static_cast<char *>(got.value), static_cast<size_t>(got.length));
-            which = g == old_acl ? 1 : g == new_acl ? 2 : 0;
-        }
+        const std::string g = rc == 0 ? std::string(static_cast<char *>(got.value), static_cast<size_t>(got.length)) : "";
         sec_release_acl(&got);
-        return which;
+        if (rc == 0 && rflags == SEC_ACLF_CONVERT_CACHE) return g == old_acl ? 1 : g == new_acl ? 2 : 0;
+        if (rc == 0 && rflags == SEC_ACLF_FROM_TEXT) return g == text_acl ? 3 : 0;
+        return 0;
     }
 };
 
@@ -165,11 +172,18 @@ TEST_F(CrashConsistency, KilledBeforeEachFileOperation) {
 // Writers killed at random times, replacing the cache over and over, while
 // a reader in another process reads it as fast as it can.
 TEST_F(CrashConsistency, KilledAtRandomTimesWithAReaderAlongside) {
+    // Kills are spread over about three replacements, however long one
+    // takes here (a sanitizer or valgrind slows it).
+    struct timespec t0 {}, t1 {};
+    clock_gettime(CLOCK_MONOTONIC, &t0);
+    ASSERT_EQ(store(acl, new_acl), 0);
     ASSERT_EQ(store(acl, old_acl), 0);
+    clock_gettime(CLOCK_MONOTONIC, &t1);
+    const long span_ns = std::max(2000000L, 3 * ((t1.tv_sec - t0.tv_sec) * 1000000000L + t1.tv_nsec - t0.tv_nsec) / 2);
     age_text();
     struct tally {
         std::atomic<int> stop;
-        std::atomic<long> reads, old_seen, new_seen, wrong;
+        std::atomic<long> reads, old_seen, new_seen, text_seen, wrong, stores;
     };
     auto *t = static_cast<tally *>(mmap(nullptr, sizeof(tally), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
     ASSERT_NE(t, MAP_FAILED);
@@ -182,6 +196,7 @@ TEST_F(CrashConsistency, KilledAtRandomTimesWithAReaderAlongside) {
             ++t->reads;
             if (which == 1) ++t->old_seen;
             else if (which == 2) ++t->new_seen;
+            else if (which == 3) ++t->text_seen;
             else ++t->wrong;
         }
         _exit(0);
@@ -190,11 +205,19 @@ TEST_F(CrashConsistency, KilledAtRandomTimesWithAReaderAlongside) {
     std::mt19937 rng(20261123);
     int debris = 0, rounds = 40;
     for (int round = 0; round < rounds; ++round) {
+        const long done = t->stores.load();
         pid_t writer = fork();
         if (writer == 0) {
-            for (long i = 0;; ++i) store(acl, i % 2 ? old_acl : new_acl);
+            for (long i = 0;; ++i) {
+                store(acl, i % 2 ? old_acl : new_acl);
+                ++t->stores;
+            }
         }
-        struct timespec nap {0, static_cast<long>(rng() % 40000000)};  // up to 40 ms
+        // After the first replacement of the round (a fork may start
+        // slowly), then at any time.
+        while (t->stores.load() == done) usleep(100);
+        const long ns = static_cast<long>(rng() % static_cast<unsigned long>(span_ns));
+        struct timespec nap {ns / 1000000000L, ns % 1000000000L};
         nanosleep(&nap, nullptr);
         kill(writer, SIGKILL);
         int status = 0;
@@ -205,11 +228,13 @@ TEST_F(CrashConsistency, KilledAtRandomTimesWithAReaderAlongside) {
     int status = 0;
     ASSERT_EQ(waitpid(reader, &status, 0), reader);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
-    EXPECT_EQ(t->wrong.load(), 0) << "reads that were neither the old nor the new compiled ACL";
+    EXPECT_EQ(t->wrong.load(), 0) << "reads that were neither the old nor the new compiled ACL, nor the text's";
     EXPECT_GT(t->old_seen.load(), 0);
     EXPECT_GT(t->new_seen.load(), 0);
-    std::printf("[ crash    ] %d random kills (%d left a temporary); reader: %ld reads, %ld old, %ld new, %ld other\n",
-                rounds, debris, t->reads.load(), t->old_seen.load(), t->new_seen.load(), t->wrong.load());
+    std::printf("[ crash    ] %d random kills (%d left a temporary); reader: %ld reads, %ld old, %ld new, "
+                "%ld text (cache replaced under it), %ld other\n",
+                rounds, debris, t->reads.load(), t->old_seen.load(), t->new_seen.load(), t->text_seen.load(),
+                t->wrong.load());
     munmap(t, sizeof(tally));
 
     rytest::run_result r = rytest::run_ryaclfck({"-s", "-f", acl});
