@@ -238,21 +238,38 @@ int32_t direct_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &
 // ---- The tree road ------------------------------------------------------------
 
 // Whether the sub-ACLs the header counts, stepped through by their lengths,
-// end exactly at the end of the block.  An appended sub-ACL is counted as
-// the one after the last; if other bytes lay there (bytes after the last
-// sub-ACL, or entries running past its length, both of which validation
-// lets pass), counting one more would bring them to life as a sub-ACL that
-// nobody validated.
+// end exactly at the end of the block, and the last one's entries exactly
+// at its own end.  An appended sub-ACL is counted as the one after the
+// last; if other bytes lay there (bytes after the last sub-ACL, or entries
+// running past its length, both of which validation lets pass), counting
+// one more would bring them to life as a sub-ACL that nobody validated.
+// And the last sub-ACL, no longer last, would have validation compare its
+// entries with its length for the first time: slack inside it would make
+// a valid ACL invalid.
 bool counted_subacls_fill(const unsigned char *base, size_t total) {
     const unsigned nsub = acl__load_le16(base + 3);
-    size_t pos = ACL_HDR_SIZE;
+    size_t pos = ACL_HDR_SIZE, last = 0;
     for (unsigned k = 0; k < nsub; ++k) {
         if (total - pos < ACL_SUBACL_HDR_SIZE) return false;
         const size_t len = acl__load_le32(base + pos);
         if (len < ACL_SUBACL_HDR_SIZE || len > total - pos) return false;
+        last = pos;
         pos += len;
     }
-    return pos == total;
+    if (pos != total) return false;
+    if (nsub == 0) return true;
+    const unsigned char *sub = base + last;
+    const size_t len = total - last;
+    size_t at = ACL_SUBACL_HDR_SIZE + size_t{sub[9]};
+    if (at > len) return false;
+    const uint32_t count = acl__load_le32(sub + 5);
+    for (uint32_t e = 0; e < count; ++e) {  // each entry moves on 7 bytes or more
+        if (len - at < ACL_ENTRY_HDR_SIZE) return false;
+        const size_t idlen = acl__load_le16(sub + at + 5);
+        if (len - at - ACL_ENTRY_HDR_SIZE < idlen) return false;
+        at += ACL_ENTRY_HDR_SIZE + idlen;
+    }
+    return at == len;
 }
 
 // Put `fresh` in place of the sub-ACL at `where`, or append it when there
