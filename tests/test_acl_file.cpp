@@ -1,12 +1,12 @@
 // Reading an ACL file whole from its descriptor: NUL bytes, empty files,
-// descriptors that are not regular files, files that change under the
-// reader, allocation failure.
+// files that change under the reader, every failure leaving no buffer.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <cstring>
 #include <functional>
 #include <string>
 
@@ -16,52 +16,44 @@
 namespace {
 
 std::function<void()> g_on_read;  // run before each read() of the reader
-struct on_read {
-    explicit on_read(std::function<void()> f) {
-        g_on_read = std::move(f);
-        acl__set_file_step_hook([](const char *s, const char *) { if (std::string(s) == "read:read") g_on_read(); });
-    }
-    ~on_read() { acl__set_file_step_hook(nullptr); }
-};
 
 struct result {
-    int32_t rc = 0;
-    char *buf = reinterpret_cast<char *>(&rc);  // outputs must be overwritten whatever happens
-    size_t size = 77;
-    ~result() { std::free(buf == reinterpret_cast<char *>(&rc) ? nullptr : buf); }
+    int32_t rc;
+    bool cleared;      // no buffer and size 0
+    std::string text;  // what was read, with the terminator
 };
-
-void read_fd(int fd, result &r) { r.rc = acl__read_acl_file("acl", fd, &r.buf, &r.size); }
-void read_path(const std::string &path, result &r) {
+result read_fd(int fd, std::function<void()> on_read = {}) {
+    g_on_read = std::move(on_read);
+    acl__set_file_step_hook([](const char *s, const char *) { if (g_on_read && !std::strcmp(s, "read:read")) g_on_read(); });
+    char junk, *buf = &junk;  // outputs must be overwritten whatever happens
+    size_t size = 77;
+    result r{acl__read_acl_file("acl", fd, &buf, &size), false, ""};
+    acl__set_file_step_hook(nullptr);
+    r.cleared = buf == nullptr && size == 0;
+    if (buf && buf != &junk) r.text.assign(buf, size + 1);
+    if (buf != &junk) std::free(buf);
+    return r;
+}
+result read_path(const std::string &path, std::function<void()> on_read = {}) {
     int fd = open(path.c_str(), O_RDONLY | O_NONBLOCK);
-    read_fd(fd, r);
+    result r = read_fd(fd, std::move(on_read));
     if (fd >= 0) close(fd);
-}
-void expect_failed(const result &r, int32_t rc, int32_t msg) {
-    EXPECT_EQ(r.rc, rc);
-    EXPECT_EQ(rytest::error_msgnum(), msg);
-    EXPECT_TRUE(r.buf == nullptr && r.size == 0);
+    return r;
 }
 
-TEST(AclFileRead, WholeContentsWithNulBytesAndEmptyFile) {
+TEST(AclFileRead, WholeContentsWithNulBytesAndEmptyFileWithoutAllocating) {
     rytest::tmp_dir d;
     std::string body(70000, '\0');
     for (size_t i = 0; i < body.size(); ++i) body[i] = static_cast<char>(i % 251);
     rytest::write_file(d / "acl", body);
-    result r, e;
-    read_path(d / "acl", r);
-    ASSERT_EQ(r.rc, 0);
-    ASSERT_EQ(r.size, body.size());
-    EXPECT_EQ(std::string(r.buf, r.size), body);
-    EXPECT_EQ(r.buf[body.size()], '\0');
-
+    result r = read_path(d / "acl");
+    EXPECT_TRUE(r.rc == 0 && r.text == body + '\0');
     rytest::write_file(d / "empty", "");
-    rytest::alloc_fail_nth(1);  // an empty file must not allocate
-    read_path(d / "empty", e);
+    rytest::alloc_fail_nth(1);
+    r = read_path(d / "empty");
     EXPECT_EQ(rytest::alloc_count(), 0);
     rytest::alloc_fail_none();
-    EXPECT_TRUE(e.rc == 0 && e.buf == nullptr && e.size == 0);
-    EXPECT_EQ(acl__lock_acl_file("acl", -1, 2), 0);
+    EXPECT_TRUE(r.rc == 0 && r.cleared);
 }
 
 TEST(AclFileRead, ReadsTheOpenFileUpToItsSizeNotWhatTheNameBecomes) {
@@ -70,54 +62,35 @@ TEST(AclFileRead, ReadsTheOpenFileUpToItsSizeNotWhatTheNameBecomes) {
     int fd = open((d / "acl").c_str(), O_RDONLY), grow = open((d / "acl").c_str(), O_WRONLY | O_APPEND);
     rytest::write_file(d / "other", "a much longer replacement\n");
     ASSERT_EQ(rename((d / "other").c_str(), (d / "acl").c_str()), 0);
-    on_read h([&] { (void)!write(grow, "more", 4); });
-    result r;
-    read_fd(fd, r);
-    EXPECT_EQ(r.rc, 0);
-    EXPECT_EQ(std::string(r.buf, r.size), "first\n");
+    result r = read_fd(fd, [&] { (void)!write(grow, "more", 4); });
+    EXPECT_TRUE(r.rc == 0 && r.text == std::string("first\n", 7)) << r.text;
     close(grow);
     close(fd);
 }
 
-TEST(AclFileRead, RefusesMissingFilesAndWhatIsNotARegularFile) {
+TEST(AclFileRead, FailuresGiveTheirMessageAndNoBuffer) {
     rytest::tmp_dir d;
     ASSERT_EQ(mkfifo((d / "fifo").c_str(), 0600), 0);
-    result missing, dir, fifo;
-    read_path(d / "missing", missing);  // the caller's open failed
-    expect_failed(missing, 37, 122);
-    EXPECT_NE(rytest::error_text().find("errno = " + std::to_string(EBADF)), std::string::npos);
-    read_path(d.path(), dir);
-    expect_failed(dir, 37, 122);
-    read_path(d / "fifo", fifo);
-    expect_failed(fifo, 37, 122);
-}
-
-TEST(AclFileRead, FileThatShrinksAfterTheSizeIsTakenIsAShortRead) {
-    rytest::tmp_dir d;
     rytest::write_file(d / "acl", std::string(1000, 'a'));
-    on_read h([&] { (void)!truncate((d / "acl").c_str(), 400); });
-    result r;
-    read_path(d / "acl", r);
-    expect_failed(r, 37, 126);
-    EXPECT_NE(rytest::error_text().find("only 400 bytes out of a total\nof 1000 bytes"), std::string::npos);
-}
-
-TEST(AclFileRead, AllocationFailureLeavesNothing) {
-    rytest::tmp_dir d;
+    const struct { std::string path; int32_t msg; std::string shows; } cases[] = {
+        {d / "missing", 122, "errno = " + std::to_string(EBADF)},  // the caller's open failed
+        {d.path(), 122, ""},
+        {d / "fifo", 122, ""},
+        {d / "acl", 126, "only 400 bytes out of a total\nof 1000 bytes"},  // shrinks after the size is taken
+    };
+    for (const auto &c : cases) {
+        result r = read_path(c.path, [&] { (void)!truncate(c.path.c_str(), 400); });
+        EXPECT_TRUE(r.rc == 37 && r.cleared) << c.path;
+        EXPECT_EQ(rytest::error_msgnum(), c.msg) << c.path;
+        EXPECT_NE(rytest::error_text().find(c.shows), std::string::npos) << rytest::error_text();
+    }
     rytest::write_file(d / "acl", std::string(300, 'a'));
-    long sites = rytest::for_each_alloc_failure(
-        [&] {
-            result r;
-            read_path(d / "acl", r);
-            if (r.rc) { EXPECT_TRUE(r.buf == nullptr && r.size == 0); }
-            return r.rc;
-        },
-        [&](int32_t rc, long) {
-            EXPECT_EQ(rc, 6);
-            EXPECT_EQ(rytest::error_msgnum(), 89);
-            EXPECT_NE(rytest::error_text().find("Attempted allocation: 301 bytes"), std::string::npos);
-        });
-    EXPECT_EQ(sites, 1);
+    rytest::alloc_fail_nth(1);  // the one allocation: size and terminator
+    result r = read_path(d / "acl");
+    EXPECT_EQ(rytest::alloc_count(), 1);
+    rytest::alloc_fail_none();
+    EXPECT_TRUE(r.rc == 6 && r.cleared && rytest::error_msgnum() == 89);
+    EXPECT_NE(rytest::error_text().find("Attempted allocation: 301 bytes"), std::string::npos);
 }
 
 }  // namespace

@@ -61,12 +61,6 @@ std::vector<std::string> words_of(const std::string &text) {
     return words;
 }
 
-std::string parse_all(const std::string &text) {
-    std::string s;
-    for (const std::string &w : words_of(text)) s += (s.empty() ? "" : " ") + w;
-    return s;
-}
-
 TEST(AclParse, LineOutcomesLimitsAndMessages) {
     const std::string x1094(1094, 'x'), a1093(1093, 'a');
     const struct { std::string text, expect; } cases[] = {
@@ -93,7 +87,11 @@ TEST(AclParse, LineOutcomesLimitsAndMessages) {
         {"g a" + a1093, "E145@1"},
         {"x " + x1094 + x1094 + "\n", "E145@1"},
     };
-    for (const auto &c : cases) EXPECT_EQ(parse_all(c.text), c.expect) << c.text;
+    for (const auto &c : cases) {
+        std::string all;
+        for (const std::string &w : words_of(c.text)) all += (all.empty() ? "" : " ") + w;
+        EXPECT_EQ(all, c.expect) << c.text;
+    }
 }
 
 // Texts built from pieces of the grammar and random bytes: every call

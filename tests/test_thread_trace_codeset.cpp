@@ -30,10 +30,8 @@ const std::string g_file = [] {
     return f;
 }();
 
-constexpr int kThreads = 8;
-constexpr int kRounds = 300;
-
 TEST(ThreadTraceCodeset, ConcurrentConversionsAndTracePointsStayCorrectAndWhole) {
+    constexpr int kThreads = 8, kRounds = 300;
     std::latch start(kThreads);
     std::vector<int> failures(kThreads, 0);
     std::vector<std::thread> threads;
@@ -50,9 +48,7 @@ TEST(ThreadTraceCodeset, ConcurrentConversionsAndTracePointsStayCorrectAndWhole)
                                          : acl__convert_from_utf8(text.c_str(), &inlen, &out, &outlen);
                 failures[t] += rc != 0 || !out || outlen != inlen || std::memcmp(out, text.c_str(), inlen) != 0;
                 std::free(out);
-
-                // An invalid text fails in this thread's slot.
-                out = nullptr, outlen = 0, inlen = 5;
+                out = nullptr, outlen = 0, inlen = 5;  // an invalid text fails in this thread's slot
                 rc = acl__convert_to_utf8("bad\xff", &inlen, &out, &outlen);
                 failures[t] += rc != 26 || out || rytest::error_msgnum() != 130;
                 tr::api_exit(13, 13, rc);
@@ -65,16 +61,14 @@ TEST(ThreadTraceCodeset, ConcurrentConversionsAndTracePointsStayCorrectAndWhole)
     // Interleaved writes would break lines apart or run two together: every
     // line must hold exactly the numbers its point carries.
     std::istringstream in(rytest::read_file(g_file));
-    std::string line;
     std::map<unsigned, int> per_id;
-    while (std::getline(in, line)) {
+    for (std::string line; std::getline(in, line);) {
         std::istringstream f(line);
         std::string when, pid, tid, component, item;
-        unsigned id = 0;
+        unsigned id = 0, items = 0;
         ASSERT_TRUE(f >> when >> pid >> tid >> component >> id && component == "_SEL") << line;
-        std::vector<unsigned long long> v;
-        while (f >> item) v.push_back(std::stoull(item));  // "<decimal>/0x<hex>"
-        ASSERT_EQ(v.size(), id == 115 ? 2u : 1u) << line;
+        for (; f >> item; ++items) (void)std::stoull(item);  // "<decimal>/0x<hex>"
+        ASSERT_EQ(items, id == 115 ? 2u : 1u) << line;
         ++per_id[id];
     }
     EXPECT_EQ(per_id[0], 1);  // registration ran once
