@@ -1,20 +1,24 @@
 // ACL trees.  A tree keeps the entries of one sub-ACL in insertion order in
 // a compact array, their identifiers (and any mechanism spelling that
-// differs from the first entry's) in one byte arena, and an open-addressing
-// index on the case-folded identifier.  Duplicates are found in O(1) and
-// nothing recurses, so a file sorted by identifier (which would degenerate
-// an unbalanced search tree into a chain) costs what a shuffled one does.
+// differs from the first entry's) in one byte arena, and finds duplicates
+// without comparing along a path: while identifiers arrive in one
+// direction (a sorted or reverse-sorted file, a sub-ACL read back) only
+// the previous entry can be a duplicate; a small unordered tree scans its
+// entries' hashes; a larger one keeps an open-addressing index on the
+// case-folded identifier.  Nothing recurses, so a file sorted by
+// identifier (which degenerates an unbalanced search tree into a chain)
+// costs what a shuffled one does.
 //
 // The order a writer needs is produced only when entries are visited:
 // insertion order for expanded entries, ascending case-insensitive
-// identifier for user and group entries.  The tree remembers how long a
-// prefix of its entries arrived already ascending (a sorted file, or a
-// sub-ACL read back from a buffer), so that case is a plain walk and only
-// the unsorted tail is ever sorted and merged in.
+// identifier for user and group entries.  An ascending tree is walked
+// forwards, a descending one backwards; otherwise only the part after the
+// ascending prefix is sorted and merged in, so one entry added to a tree
+// read back costs a walk, not a sort.
 //
 // A tree that has only ever held one entry keeps it inline in a single
 // heap block: an ACL whose every entry has its own mechanism is a million
-// one-entry trees, and four blocks each would blow the memory budget.
+// one-entry trees, and several blocks each would blow the memory budget.
 #include "ryacl_acl_tree.h"
 
 #include <sys/mman.h>

@@ -4,9 +4,8 @@
 // group entries, insertion order for expanded entries.
 //
 // A tree is an opaque object reached through sec_acltree_t (null while
-// empty).  It holds its entries with an index on the folded identifier, so
-// inserting, finding a duplicate and deleting cost O(1) whatever the order
-// of the input, and nothing recurses.
+// empty).  Inserting and finding a duplicate cost O(1) whatever the order
+// of the input (deleting at most O(log n)), and nothing recurses.
 #pragma once
 
 #include <cstddef>
