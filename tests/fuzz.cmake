@@ -15,7 +15,7 @@ foreach(src ${_fuzz_sources})
   add_test(NAME ${name}_replay COMMAND $<TARGET_FILE:replay_${name}> ${corpus})
   set_tests_properties(${name}_replay PROPERTIES LABELS "fuzz")
 
-  if(RYACL_FUZZ AND CMAKE_CXX_COMPILER_ID MATCHES "Clang")
+  if(RYACL_FUZZ AND CMAKE_CXX_COMPILER_ID MATCHES "Clang" AND NOT RYACL_SANITIZE MATCHES "thread")
     set(scratch ${CMAKE_BINARY_DIR}/fuzz-scratch/${name})
     # -timeout: one input running 10 s is a hang, reported like a crash.
     add_test(NAME ${name}_run
