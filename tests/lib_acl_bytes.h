@@ -2,6 +2,7 @@
 // the library's own writer, and a few helpers around descriptors.
 #pragma once
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -11,46 +12,48 @@
 #include <vector>
 
 #include "ryacl.h"
+#include "ryacl_test_support.h"
 
 namespace libtest {
 
 using bytes = std::vector<unsigned char>;
 
-inline void put16(bytes &b, unsigned v) {
-    b.push_back(static_cast<unsigned char>(v));
-    b.push_back(static_cast<unsigned char>(v >> 8));
+inline void put(bytes &b, uint32_t v, int n) {
+    for (int i = 0; i < n; ++i) b.push_back(static_cast<unsigned char>(v >> (8 * i)));
 }
-inline void put32(bytes &b, uint32_t v) {
-    for (int i = 0; i < 4; ++i) b.push_back(static_cast<unsigned char>(v >> (8 * i)));
+inline uint32_t get(const bytes &b, size_t off, size_t n) {
+    uint32_t v = 0;
+    while (n-- > 0) v = v << 8 | b[off + n];
+    return v;
 }
 
-struct ent {
-    uint32_t perm;
-    std::string id;  // empty: no identifier (types 1 and 2)
-};
+// A call's return code with the message number it recorded, compared as one.
+using rc_msg = std::pair<int32_t, int32_t>;
+inline rc_msg with_msg(int32_t rc) { return {rc, rytest::error_msgnum()}; }
+
+struct ent { uint32_t perm; std::string id; };  // id empty: none (types 1 and 2)
 
 // One sub-ACL; mech "" writes no mechanism.
 inline bytes subacl(unsigned type, const std::string &mech, const std::vector<ent> &entries) {
     bytes b;
-    put32(b, 0);
+    put(b, 0, 4);  // the length, filled in last
     b.push_back(static_cast<unsigned char>(type));
-    put32(b, static_cast<uint32_t>(entries.size()));
+    put(b, static_cast<uint32_t>(entries.size()), 4);
     b.push_back(static_cast<unsigned char>(mech.empty() ? 0 : mech.size() + 1));
     if (!mech.empty()) b.insert(b.end(), mech.c_str(), mech.c_str() + mech.size() + 1);
     for (const ent &e : entries) {
         b.push_back(1);
-        put32(b, e.perm);
-        put16(b, e.id.empty() ? 0 : static_cast<unsigned>(e.id.size() + 1));
+        put(b, e.perm, 4);
+        put(b, e.id.empty() ? 0 : static_cast<uint32_t>(e.id.size() + 1), 2);
         if (!e.id.empty()) b.insert(b.end(), e.id.c_str(), e.id.c_str() + e.id.size() + 1);
     }
-    const uint32_t n = static_cast<uint32_t>(b.size());
-    for (int i = 0; i < 4; ++i) b[static_cast<size_t>(i)] = static_cast<unsigned char>(n >> (8 * i));
+    for (size_t i = 0; i < 4; ++i) b[i] = static_cast<unsigned char>(b.size() >> (8 * i));
     return b;
 }
 
 inline bytes make_acl(const std::vector<bytes> &subs) {
     bytes b{0x85, 0x01, 0x02};
-    put16(b, static_cast<unsigned>(subs.size()));
+    put(b, static_cast<uint32_t>(subs.size()), 2);
     for (const bytes &s : subs) b.insert(b.end(), s.begin(), s.end());
     return b;
 }
@@ -58,7 +61,42 @@ inline bytes make_acl(const std::vector<bytes> &subs) {
 // The 61-byte example: anyother 1; user unix Alice 3, bob 1.
 inline bytes worked_example() {
     return make_acl({subacl(SEC_ACLE_TYPE_USER, "unix", {{3, "Alice"}, {1, "bob"}}),
-                subacl(SEC_ACLE_TYPE_ANYOTHER, "", {{1, ""}})});
+                     subacl(SEC_ACLE_TYPE_ANYOTHER, "", {{1, ""}})});
+}
+
+// A valid host-order ACL with every multi-byte field reversed and the byte
+// ordering set to 1, walked here without the library.
+inline bytes reversed(bytes b) {
+    auto flip = [&](size_t off, size_t n) {
+        std::reverse(b.begin() + static_cast<long>(off), b.begin() + static_cast<long>(off + n));
+    };
+    size_t pos = 5;
+    for (uint32_t s = 0, nsub = get(b, 3, 2); s < nsub; ++s) {
+        const uint32_t len = get(b, pos, 4), count = get(b, pos + 5, 4);
+        size_t e = pos + 10 + b[pos + 9];
+        for (uint32_t i = 0; i < count; ++i) {
+            const size_t next = e + 7 + get(b, e + 5, 2);
+            flip(e + 1, 4);  // permission
+            flip(e + 5, 2);  // identifier length
+            e = next;
+        }
+        flip(pos, 4);      // sub-ACL length
+        flip(pos + 5, 4);  // entry count
+        pos += len;
+    }
+    flip(3, 2);
+    b[2] = 1;
+    return b;
+}
+
+// An entry record; types 1 and 2 carry no identifier.
+inline sec_acle_desc entry(unsigned type, uint32_t perm, const char *mech, const char *id) {
+    sec_acle_desc e{};
+    e.type = static_cast<unsigned char>(type);
+    e.perm = perm;
+    std::strncpy(e.mech, mech, sizeof e.mech - 1);
+    e.id = type >= 4 ? const_cast<char *>(id) : nullptr;
+    return e;
 }
 
 // A heap copy in a descriptor, sized exactly, so a sanitizer sees any read
@@ -76,8 +114,7 @@ inline bytes view(const sec_buffer_desc &d) {
 }
 inline void drop(sec_buffer_desc &d) {
     std::free(d.value);
-    d.value = nullptr;
-    d.length = 0;
+    d = {0, nullptr};
 }
 
 // Mutants of a valid buffer: every bit flipped, every byte value (every
@@ -89,40 +126,13 @@ inline std::vector<bytes> mutants(const bytes &base, std::initializer_list<size_
         out.push_back(base);
         out.back()[i / 8] ^= static_cast<unsigned char>(1u << (i % 8));
     }
-    for (size_t off : offsets) {
+    for (size_t off : offsets)
         for (unsigned v = 0; v < 256; v += step) {
             out.push_back(base);
             out.back()[off] = static_cast<unsigned char>(v);
         }
-    }
-    for (size_t n = 0; n < base.size(); ++n) out.emplace_back(base.begin(), base.begin() + n);
+    for (size_t n = 0; n < base.size(); ++n) out.emplace_back(base.begin(), base.begin() + static_cast<long>(n));
     return out;
 }
-
-// Entries of a list as "type:mech:id:perm" strings.
-inline std::vector<std::string> describe(const sec_acle_list_desc &l) {
-    std::vector<std::string> out;
-    for (int32_t i = 0; i < l.count; ++i) {
-        const sec_acle_desc *e = l.acles[i];
-        out.push_back(std::to_string(e->type) + ":" + e->mech + ":" + (e->id ? e->id : "-") + ":" +
-                      std::to_string(e->perm));
-    }
-    return out;
-}
-
-// An entry record on the stack.
-struct entry_rec {
-    sec_acle_desc d{};
-    std::string id;
-    entry_rec(unsigned type, uint32_t perm, const std::string &mech, const std::string &ident,
-              bool with_id = true)
-        : id(ident) {
-        d.type = static_cast<unsigned char>(type);
-        d.perm = perm;
-        std::strncpy(d.mech, mech.c_str(), sizeof d.mech - 1);
-        d.id = with_id ? const_cast<char *>(id.c_str()) : nullptr;
-    }
-    sec_acle_t get() { return &d; }
-};
 
 }  // namespace libtest

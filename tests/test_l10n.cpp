@@ -17,52 +17,38 @@ namespace {
 const char kLocale[] = "C.UTF-8";
 const char kMissingF[] = "4471-162 Echec : l'option -f manque.\n";
 
-// A catalog holding two translated messages (148, 122), built the way an
-// administrator builds one.
-std::string build_catalog(const rytest::tmp_dir &dir, const std::string &target) {
-    std::string src = dir / "fr.msg";
-    rytest::write_file(src, std::string("$quote \"\n$set 1\n") + "148 \"4471-162 Echec : l'option -f manque.\\n\"\n" +
-                                "122 \"4471-135 Echec : fichier introuvable : %1$s (errno %2$d).\\n\"\n");
-    EXPECT_EQ(std::system(("mkdir -p '" + target.substr(0, target.rfind('/')) + "'").c_str()), 0);
-    auto r = rytest::run({RYACL_GENCAT, target, src});
-    EXPECT_EQ(r.status, 0) << r.err;
-    return target;
+// A catalog of two translated messages (148, 122) at `target`, built the way
+// an administrator builds one.
+void build_catalog(const rytest::tmp_dir &dir, const std::string &target) {
+    rytest::write_file(dir / "fr.msg", "$quote \"\n$set 1\n148 \"4471-162 Echec : l'option -f manque.\\n\"\n"
+                                       "122 \"4471-135 Echec : fichier introuvable : %1$s (errno %2$d).\\n\"\n");
+    ASSERT_EQ(std::system(("mkdir -p '" + target.substr(0, target.rfind('/')) + "'").c_str()), 0);
+    auto r = rytest::run({RYACL_GENCAT, target, dir / "fr.msg"});
+    ASSERT_EQ(r.status, 0) << r.err;
 }
 
-std::vector<std::string> env_for(const char *locale, const std::string &nlspath) {
-    // "NLSPATH" without '=' removes the variable (glibc putenv).
-    return {std::string("LANG=") + locale, std::string("LC_ALL=") + locale,
-            nlspath.empty() ? std::string("NLSPATH") : "NLSPATH=" + nlspath};
+// "NLSPATH" without '=' removes the variable (glibc putenv).
+std::vector<std::string> env_for(const std::string &locale, const std::string &nlspath) {
+    return {"LANG=" + locale, "LC_ALL=" + locale, nlspath.empty() ? "NLSPATH" : "NLSPATH=" + nlspath};
 }
 
 std::string text(int num) { return zo_mesgtbl_ryseclib_msg[num]; }
 
-TEST(Localisation, CheckerPrintsTheTranslationChosenThroughNlspath) {
+TEST(Localisation, CheckerAndQueryPrintTheTranslationChosenThroughNlspath) {
     rytest::tmp_dir dir;
     build_catalog(dir, dir / (std::string(kLocale) + "/ryseclib.cat"));
-    const std::string nlspath = dir.path() + "/%L/%N";
+    const std::string nlspath = dir.path() + "/%L/%N", missing = dir / "missing.acl";
 
     auto r = rytest::run_ryaclfck({"-v"}, "", env_for(kLocale, nlspath));
     EXPECT_EQ(r.status, 4);
-    EXPECT_EQ(r.out, "");
     // The translation, then the usage text, which the catalog lacks.
     EXPECT_EQ(r.err, std::string(kMissingF) + "\n" + text(80) + "\n");
-
-    // Another locale does not find it: the built-in text.
-    r = rytest::run_ryaclfck({"-v"}, "", env_for("C", nlspath));
+    r = rytest::run_ryaclfck({"-v"}, "", env_for("C", nlspath));  // another locale: built in
     EXPECT_EQ(r.err, text(148) + "\n" + text(80) + "\n");
-}
 
-TEST(Localisation, QueryCommandGetsTranslatedLibraryMessages) {
-    rytest::tmp_dir dir;
-    build_catalog(dir, dir / (std::string(kLocale) + "/ryseclib.cat"));
-    const std::string missing = dir / "missing.acl";
-
-    auto r = rytest::run({RYACLQ_PATH, "-n", missing}, "", env_for(kLocale, dir.path() + "/%L/%N"));
+    r = rytest::run({RYACLQ_PATH, "-n", missing}, "", env_for(kLocale, nlspath));
     EXPECT_EQ(r.status, 37);
-    EXPECT_EQ(r.out, "");
     EXPECT_EQ(r.err.rfind("4471-135 Echec : fichier introuvable : " + missing + " (errno 2).\n", 0), 0u) << r.err;
-
     r = rytest::run({RYACLQ_PATH, "-n", missing}, "", env_for("C", ""));
     EXPECT_EQ(r.err.rfind("4471-135 Failure:", 0), 0u) << r.err;
 }
@@ -80,7 +66,6 @@ TEST(Localisation, InstalledCatalogIsFoundBesideTheProgram) {
     auto r = rytest::run({checker, "-v"}, "", env_for(kLocale, ""));
     EXPECT_EQ(r.status, 4);
     EXPECT_EQ(r.err.rfind(kMissingF, 0), 0u) << r.err;
-
     r = rytest::run({checker, "-v"}, "", env_for("C", ""));
     EXPECT_EQ(r.err.rfind(text(148), 0), 0u) << r.err;
 }
