@@ -97,7 +97,8 @@ bool parse_placeholder(std::string_view t, size_t i, placeholder &ph) {
             if (prec > kMaxWidth) prec = kMaxWidth;
             ++j;
         }
-        spec += "." + std::to_string(prec);
+        spec += '.';
+        spec += std::to_string(prec);
     }
     int length = 0;
     if (j < t.size() && t[j] == 'h') length = -1, ++j;
