@@ -127,10 +127,4 @@ TEST(Trace, LevelsSelectThePointsRecorded) {
     }
 }
 
-TEST(Trace, ElapsedTimeBorrowsASecondForNegativeNanoseconds) {
-    int64_t s = 0, ns = 0;
-    tr::elapsed(3, 900000000, 5, 100000000, &s, &ns);
-    EXPECT_TRUE(s == 1 && ns == 200000000) << s << " " << ns;
-}
-
 }  // namespace

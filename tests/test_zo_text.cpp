@@ -1,11 +1,17 @@
-// Locale-independent comparison, canonical IPv6 text, counters.
+// Locale-independent text utilities: case-insensitive comparison, canonical
+// IPv6 text, counters, and conversion between the local codeset and UTF-8.
+// (Allocation failures of conversions within entries, a conversion handle
+// that failed to open: test_alloc_failures.)
 #include <arpa/inet.h>
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <cstring>
 #include <string>
 
 #include "ry_zo_int.h"
+#include "ryacl_test_support.h"
+#include "ryacl_utils.h"
 
 namespace {
 
@@ -66,6 +72,54 @@ TEST(Counters, MonotonicAndConvertedExactly) {
     EXPECT_TRUE(s == 3 && ns == 500000000u) << s << " " << ns;
     ASSERT_EQ(zo_cvt_time_1(UINT64_MAX, &odd, &s, &ns), 0);
     EXPECT_TRUE(s == UINT64_MAX / 3000000000u && ns == (UINT64_MAX % 3000000000u) / 3) << s << " " << ns;
+}
+
+struct converted {
+    int32_t rc;
+    std::string text;  // the result's counted bytes
+    bool out_set;
+};
+
+converted convert(bool to, const std::string &s, bool drop_length = false) {
+    size_t inlen = s.size() + 1, outlen = 0;
+    char *out = nullptr;
+    size_t *in = drop_length ? nullptr : &inlen;
+    int32_t rc = to ? acl__convert_to_utf8(s.c_str(), in, &out, &outlen)
+                    : acl__convert_from_utf8(s.c_str(), in, &out, &outlen);
+    converted c{rc, out ? std::string(out, outlen) : std::string(), out != nullptr};
+    std::free(out);
+    return c;
+}
+
+// (Valid texts round trip: test_thread_trace_codeset.)
+TEST(Codeset, InvalidBytesGive130AndNoLengthGives23) {
+    for (const auto &[to, text] : {std::pair{true, "ab\x80" "cd"}, {false, "caf\xc3\xa9"}, {false, "ab\xc3"}}) {
+        converted c = convert(to, text);
+        EXPECT_TRUE(c.rc == 26 && rytest::error_msgnum() == 130 && !c.out_set) << text;
+    }
+    EXPECT_EQ(convert(true, "x", true).rc, 23);  // no input length: an argument fault (20)
+    const std::string text = rytest::error_text();
+    EXPECT_EQ(rytest::error_msgnum(), 91);
+    EXPECT_TRUE(text.find("security/ACL/lib/ryacl_utils") != std::string::npos &&
+                text.find("Error code: 20") != std::string::npos) << text;
+}
+
+TEST(Codeset, AllocationFailureAtAnyGrowthFreesWhatWasBuilt) {
+    // ASCII to UCS-4 quadruples the size, so the output must grow; a failure
+    // at any growth frees what was built (the sanitizer build checks leaks).
+    static zo_iconv_t h = nullptr;  // handles are never closed; keep it reachable
+    ASSERT_EQ(zo_iconv_open_1("UCS-4BE", ZO_ICONV_FROM_UTF8, &h), 0);
+    const std::string in(100, 'a');
+    auto run = [&] {
+        size_t inlen = in.size() + 1, outlen = 0;
+        char *out = nullptr;
+        int rc = zo_iconv_str_1(h, 0, in.c_str(), &inlen, &out, &outlen);
+        if (rc == 0 && (outlen != 4 * inlen || std::string(out + 396, 4) != std::string("\0\0\0a", 4))) rc = -1;
+        std::free(out);
+        return rc;
+    };
+    ASSERT_EQ(run(), 0);
+    EXPECT_GE(rytest::for_each_alloc_failure(run, [](int32_t rc, long) { EXPECT_EQ(rc, ZO_ICONV_RC_NO_MEMORY); }), 2);
 }
 
 }  // namespace
