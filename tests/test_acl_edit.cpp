@@ -99,7 +99,8 @@ TEST(Edit, ParametersEntriesAndHeadersAreRefusedBeforeAnyChange) {
     sec_buffer_desc d = own(worked_example());
     sec_acle_desc ok = entry(4, 1, "unix", "x");
     EXPECT_EQ(sec_add_acle_to_acl2(&ok, nullptr), ACL_RC_BAD_ARGS);
-    EXPECT_NE(rytest::error_text().find("sec_add_acle_to_acl2\n\tPositional parameter number: 2"), std::string::npos);
+    // Both adds share one body, whose name the message gives.
+    EXPECT_NE(rytest::error_text().find("sec_add_acle_to_acl\n\tPositional parameter number: 2"), std::string::npos);
     EXPECT_EQ(sec_del_acle_from_acl(nullptr, &d), ACL_RC_BAD_ARGS);
 
     sec_acle_desc unterminated = entry(4, 1, "", "x");
@@ -149,12 +150,11 @@ TEST(Edit, DirectAndTreeRoadsAgree) {
         const std::string id = names[rng() % std::size(names)];
         const uint32_t perm = rng() % 16;
         const int kind = static_cast<int>(rng() % 3);
-        int32_t rc[2];
+        rc_msg rc[2];
         for (int road = 0; road < 2; ++road) {
             acl__edit_direct_enabled = road == 0;
             sec_buffer_desc &d = road == 0 ? fast : slow;
-            rc[road] = kind == 2 ? del(d, type, mech, id) : add(d, type, perm, mech, id, kind == 1);
-            if (rc[road]) rc[road] = rc[road] * 1000 + rytest::error_msgnum();
+            rc[road] = with_msg(kind == 2 ? del(d, type, mech, id) : add(d, type, perm, mech, id, kind == 1));
         }
         ASSERT_EQ(rc[0], rc[1]) << "step " << step;
         ASSERT_EQ(view(fast), view(slow)) << "step " << step;
