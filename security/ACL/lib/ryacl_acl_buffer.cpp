@@ -45,47 +45,108 @@ int32_t subacl_size(sec_acltree_s *tree, const char *fname, size_t *size, size_t
     return 0;
 }
 
+// Serialised bytes go into an area: the whole result block, or a staging
+// area that is handed to a sink whenever the next record would not fit.
 struct writer {
+    unsigned char *base;
     unsigned char *p;
     size_t left;
+    const acl__byte_sink *sink = nullptr;  // null: the area is the whole result
+    size_t cap = 0;                        // staging area size
+    uint64_t written = 0;                  // bytes laid down so far
+    int32_t rc = 0;                        // the sink's failure
     bool overflow = false;
+
+    int32_t flush() {
+        const size_t used = static_cast<size_t>(p - base);
+        if (sink && used) rc = sink->put(sink->ctx, base, used);
+        p = base;
+        left = cap;
+        return rc;
+    }
+    // Room for n more bytes; a staging area is always at least one record.
+    unsigned char *take(size_t n) {
+        if (left < n && (!sink || flush() != 0 || left < n)) {
+            overflow = overflow || rc == 0;
+            return nullptr;
+        }
+        unsigned char *at = p;
+        p += n;
+        left -= n;
+        written += n;
+        return at;
+    }
 };
 
 bool write_entry(const acl__tree_entry_view *e, void *ctx) {
     auto *w = static_cast<writer *>(ctx);
     const size_t idfield = e->id ? e->idlen + 1 : 0;
-    if (w->left < ACL_ENTRY_HDR_SIZE + idfield) {
-        w->overflow = true;
-        return false;
-    }
-    unsigned char *p = w->p;
+    unsigned char *p = w->take(ACL_ENTRY_HDR_SIZE + idfield);
+    if (!p) return false;
     p[0] = 1;
     acl__store_le32(p + 1, e->perm);
     acl__store_le16(p + 5, static_cast<uint16_t>(idfield));
     if (idfield) std::memcpy(p + ACL_ENTRY_HDR_SIZE, e->id, idfield);
-    w->p += ACL_ENTRY_HDR_SIZE + idfield;
-    w->left -= ACL_ENTRY_HDR_SIZE + idfield;
     return true;
 }
 
-// Lay down the sub-ACL of `tree` in exactly `size` bytes at dst.
-int32_t write_subacl(sec_acltree_s *tree, unsigned char *dst, size_t size, size_t count,
-                     const char *fname) {
+// Lay down the sub-ACL of `tree`: exactly `size` bytes.
+int32_t write_subacl(sec_acltree_s *tree, writer *w, size_t size, size_t count, const char *fname) {
     const unsigned char type = acl__tree_type(tree);
-    size_t mechfield = 0;
-    acl__store_le32(dst, static_cast<uint32_t>(size));
-    dst[4] = type;
-    acl__store_le32(dst + 5, static_cast<uint32_t>(count));
-    if (acl__type_has_mech(type)) {
-        const char *mech = acl__tree_mech(tree);
-        mechfield = std::strlen(mech) + 1;
+    const char *mech = acl__type_has_mech(type) ? acl__tree_mech(tree) : "";
+    const size_t mechfield = acl__type_has_mech(type) ? std::strlen(mech) + 1 : 0;
+    const uint64_t start = w->written;
+    if (unsigned char *dst = w->take(ACL_SUBACL_HDR_SIZE + mechfield)) {
+        acl__store_le32(dst, static_cast<uint32_t>(size));
+        dst[4] = type;
+        acl__store_le32(dst + 5, static_cast<uint32_t>(count));
+        dst[9] = static_cast<unsigned char>(mechfield);
         std::memcpy(dst + ACL_SUBACL_HDR_SIZE, mech, mechfield);
+        if (int32_t rc = acl__tree_visit_named(tree, write_entry, w, fname)) return rc;
     }
-    dst[9] = static_cast<unsigned char>(mechfield);
-    writer w{dst + ACL_SUBACL_HDR_SIZE + mechfield, size - ACL_SUBACL_HDR_SIZE - mechfield};
-    if (int32_t rc = acl__tree_visit_named(tree, write_entry, &w, fname)) return rc;
+    if (w->rc) return w->rc;
     // The sizes come from the same entries; a mismatch is a defect here.
-    if (w.overflow || w.left != 0) return acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    if (w->overflow || w->written - start != size) return acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    return 0;
+}
+
+// Size of the compiled ACL of every tree, refusing what its header cannot
+// describe.
+int32_t acltrees_size(const acl__trees_s *trees, const char *fname, size_t *total_out, size_t *nsub_out) {
+    const int32_t n = trees ? trees->nooftrees : 0;
+    uint64_t total = ACL_HDR_SIZE;
+    size_t nsub = 0;
+    for (int32_t s = n; s-- > 0;) {
+        size_t size = 0, count = 0;
+        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) return rc;
+        if (!size) continue;
+        total += size;
+        ++nsub;
+        // Past 65535 sub-ACLs or INT32_MAX bytes the layout cannot say what
+        // it holds: refused as an allocation beyond the buffer's own limit
+        // (6, message 89), like an over-long sub-ACL.
+        if (nsub > ACL_MAX_SUBACLS || total > INT32_MAX)
+            return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+    }
+    *total_out = static_cast<size_t>(total);
+    *nsub_out = nsub;
+    return 0;
+}
+
+// The buffer header and every non-empty sub-ACL, last slot first.
+int32_t write_acltrees(const acl__trees_s *trees, size_t nsub, writer *w, const char *fname) {
+    unsigned char *h = w->take(ACL_HDR_SIZE);
+    if (!h) return w->rc ? w->rc : acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    h[0] = ACL_BUF_TYPE;
+    h[1] = ACL_BUF_VERSION;
+    h[2] = ACL_BUF_HOST_ORDER;
+    acl__store_le16(h + 3, static_cast<uint16_t>(nsub));
+    for (int32_t s = trees ? trees->nooftrees : 0; s-- > 0;) {
+        size_t size = 0, count = 0;
+        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) return rc;
+        if (!size) continue;
+        if (int32_t rc = write_subacl(trees->trees[s], w, size, count, fname)) return rc;
+    }
     return 0;
 }
 
@@ -105,7 +166,8 @@ int32_t sec__acltree_to_subacl(sec_acltree_s *tree, unsigned char **subacl, size
     if (size == 0) return 0;
     auto *block = static_cast<unsigned char *>(acl__malloc(size));
     if (!block) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(size));
-    if (int32_t rc = write_subacl(tree, block, size, count, fname)) {
+    writer w{block, block, size};
+    if (int32_t rc = write_subacl(tree, &w, size, count, fname)) {
         std::free(block);
         return rc;
     }
@@ -119,45 +181,44 @@ int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
     if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
     acl->length = 0;
     acl->value = nullptr;
-    const int32_t n = trees ? trees->nooftrees : 0;
-    uint64_t total = ACL_HDR_SIZE;
-    size_t nsub = 0;
-    for (int32_t s = n; s-- > 0;) {
-        size_t size = 0, count = 0;
-        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) return rc;
-        if (!size) continue;
-        total += size;
-        ++nsub;
-        // Past 65535 sub-ACLs or INT32_MAX bytes the layout cannot say what
-        // it holds: refused as an allocation beyond the buffer's own limit
-        // (6, message 89), like an over-long sub-ACL.
-        if (nsub > ACL_MAX_SUBACLS || total > INT32_MAX)
-            return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
-    }
-    auto *buf = static_cast<unsigned char *>(acl__malloc(static_cast<size_t>(total)));
+    size_t total = 0, nsub = 0;
+    if (int32_t rc = acltrees_size(trees, fname, &total, &nsub)) return rc;
+    auto *buf = static_cast<unsigned char *>(acl__malloc(total));
     if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
-    acl__advise_large(buf, static_cast<size_t>(total));
-    buf[0] = ACL_BUF_TYPE;
-    buf[1] = ACL_BUF_VERSION;
-    buf[2] = ACL_BUF_HOST_ORDER;
-    acl__store_le16(buf + 3, static_cast<uint16_t>(nsub));
-    size_t off = ACL_HDR_SIZE;
-    for (int32_t s = n; s-- > 0;) {
-        size_t size = 0, count = 0;
-        if (int32_t rc = subacl_size(trees->trees[s], fname, &size, &count)) {
-            std::free(buf);
-            return rc;
-        }
-        if (!size) continue;
-        if (int32_t rc = write_subacl(trees->trees[s], buf + off, size, count, fname)) {
-            std::free(buf);
-            return rc;
-        }
-        off += size;
+    acl__advise_large(buf, total);
+    writer w{buf, buf, total};
+    if (int32_t rc = write_acltrees(trees, nsub, &w, fname)) {
+        std::free(buf);
+        return rc;
     }
     acl->length = static_cast<int32_t>(total);
     acl->value = buf;
     return 0;
+}
+
+int32_t acl__acltrees_size(const acl__trees_s *trees, size_t *total) {
+    size_t nsub = 0;
+    *total = 0;
+    return acltrees_size(trees, "sec__acltrees_to_acl", total, &nsub);
+}
+
+int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__byte_sink *sink) {
+    const char *fname = "sec__acltrees_to_acl";
+    size_t total = 0, nsub = 0;
+    if (int32_t rc = acltrees_size(trees, fname, &total, &nsub)) return rc;
+    // One record (at most a 7-byte header and a 65535-byte identifier field)
+    // always fits; a quarter of a megabyte keeps the writes few and the
+    // staging area in cache.
+    constexpr size_t kStage = size_t{256} << 10;
+    static_assert(kStage >= ACL_ENTRY_HDR_SIZE + ACL_MAX_IDLEN + 1);
+    auto *stage = static_cast<unsigned char *>(acl__malloc(kStage));
+    if (!stage) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(kStage));
+    writer w{stage, stage, kStage, sink, kStage};
+    int32_t rc = write_acltrees(trees, nsub, &w, fname);
+    if (rc == 0) rc = w.flush();
+    if (rc == 0 && w.written != total) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    std::free(stage);
+    return rc;
 }
 
 // Every refusal below is of a sub-ACL that did not come from this

@@ -44,6 +44,19 @@ int32_t sec__acltree_to_subacl(sec_acltree_s *tree, unsigned char **subacl, size
 // Serialise every tree, last slot first, into a new compiled ACL in *acl.
 // Sized first and allocated once.
 int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl);
+// Where streamed bytes go: put() receives consecutive pieces and returns 0,
+// or a failure it has recorded, which ends the stream.
+struct acl__byte_sink {
+    int32_t (*put)(void *ctx, const unsigned char *p, size_t n);
+    void *ctx;
+};
+// Size in bytes of the compiled ACL sec__acltrees_to_acl would build, with
+// the same refusals.
+int32_t acl__acltrees_size(const acl__trees_s *trees, size_t *total);
+// The same bytes as sec__acltrees_to_acl, streamed through a small staging
+// area instead of built whole: a compiled ACL written to a file never needs
+// its full size in memory.
+int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__byte_sink *sink);
 // Read the sub-ACL at `subacl` (with `avail` bytes up to the end of the
 // block) back into a new tree; never reads past avail.
 int32_t sec__subacl_to_acltree(const unsigned char *subacl, size_t avail, sec_acltree_t *tree);

@@ -15,6 +15,7 @@
 #include <cstdio>
 #include <cstring>
 
+#include "ryacl_acl_buffer.h"
 #include "ryacl_acl_file.h"
 #include "ryacl_error.h"
 #include "ryacl_trace.h"
@@ -51,9 +52,16 @@ uint16_t random16() {
     return static_cast<uint16_t>(x);
 }
 
+// The bytes of a cache file: `length` of them, handed to a sink in order.
+struct cache_source {
+    size_t length;
+    int32_t (*produce)(const void *ctx, const acl__byte_sink *sink);
+    const void *ctx;
+};
+
 struct cache_writer {
     const char *aclfname;
-    const sec_acl_buffer_desc *acl;
+    cache_source src;
     char caclfname[ACL_FNAME_AREA];
     char tmpname[ACL_FNAME_AREA];
     struct stat acl_st {};
@@ -69,6 +77,9 @@ struct cache_writer {
     int32_t create_tmp();
     int32_t fill_tmp();
     void cleanup(int32_t rc);
+
+    size_t done = 0;  // bytes written to the temporary file
+    static int32_t put(void *ctx, const unsigned char *p, size_t n);
 };
 
 // Steps 5 to 10 of the store: look at an existing cache without following a
@@ -160,23 +171,26 @@ int32_t cache_writer::create_tmp() {
 // Write, then give the file its identity, then make it durable, all on the
 // descriptor: the file never appears under its final name with the wrong
 // owner or mode, and a crash after the rename finds it whole.
-int32_t cache_writer::fill_tmp() {
-    const char *data = static_cast<const char *>(acl->value);
-    size_t len = static_cast<size_t>(acl->length);
-    size_t done = 0;
-    int lerrno = 0;
-    while (done < len) {
-        acl__file_step("cache:write", tmpname);
-        ssize_t n = write(tmpfd, data + done, len - done);
-        if (n < 0) {
-            if (errno == EINTR) continue;
-            lerrno = errno;
-            break;
-        }
-        if (n == 0) break;  // no progress and no errno: give up, not spin
-        done += static_cast<size_t>(n);
+int32_t cache_writer::put(void *ctx, const unsigned char *data, size_t len) {
+    auto *w = static_cast<cache_writer *>(ctx);
+    size_t at = 0;
+    while (at < len) {
+        acl__file_step("cache:write", w->tmpname);
+        ssize_t n = write(w->tmpfd, data + at, len - at);
+        if (n < 0 && errno == EINTR) continue;
+        // n == 0: no progress and no errno; give up rather than spin.
+        if (n <= 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, w->done, w->src.length, n < 0 ? errno : 0);
+        at += static_cast<size_t>(n);
+        w->done += static_cast<size_t>(n);
     }
-    if (done != len) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, lerrno);
+    return 0;
+}
+
+int32_t cache_writer::fill_tmp() {
+    const acl__byte_sink sink{put, this};
+    if (int32_t rc = src.produce(src.ctx, &sink)) return rc;
+    const size_t len = src.length;
+    if (done != len) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, 0);
 
     acl__file_step("cache:fchown", tmpname);
     if (fchown(tmpfd, acl_st.st_uid, acl_st.st_gid) != 0) {
@@ -216,18 +230,9 @@ void cache_writer::cleanup(int32_t rc) {
     if (dirfd >= 0) close(dirfd);
 }
 
-}  // namespace
-
-int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *acl, sec_boolean_t force) {
-    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 1, 0);
-    // An absent descriptor holds no ACL, like an empty one.
-    if (!acl || acl->length == 0) {
-        if (tr::level(tr::INFO) == 1) tr::record_data(107, {tr::str(aclfname)});
-        return ACL_RC_INFO;
-    }
-    if (acl->length < 0 || !acl->value)
-        return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 2, acl);
-
+// Everything after the caller's own checks: name, directory, identity of
+// the ACL file, the existing cache, the temporary file, its bytes, the rename.
+int32_t store(const char *aclfname, const cache_source &src, sec_boolean_t force) {
     size_t nlen = std::strlen(aclfname);
     if (nlen > ACL_CACHE_MAX_ACLFNAME) {
         uint32_t len32 = static_cast<uint32_t>(nlen);
@@ -237,7 +242,7 @@ int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *ac
 
     cache_writer w{};
     w.aclfname = aclfname;
-    w.acl = acl;
+    w.src = src;
     std::memcpy(w.caclfname, aclfname, nlen);
     std::memcpy(w.caclfname + nlen, ACL_CACHE_SUFFIX, sizeof ACL_CACHE_SUFFIX);
 
@@ -270,4 +275,36 @@ int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *ac
     if (rc == 0) rc = w.fill_tmp();
     w.cleanup(rc);
     return rc;
+}
+
+int32_t put_buffer(const void *ctx, const acl__byte_sink *sink) {
+    const auto *acl = static_cast<const sec_acl_buffer_desc *>(ctx);
+    return sink->put(sink->ctx, static_cast<const unsigned char *>(acl->value), static_cast<size_t>(acl->length));
+}
+
+int32_t put_trees(const void *ctx, const acl__byte_sink *sink) {
+    return acl__acltrees_emit(static_cast<const acl__trees_s *>(ctx), sink);
+}
+
+}  // namespace
+
+int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *acl, sec_boolean_t force) {
+    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 1, 0);
+    // An absent descriptor holds no ACL, like an empty one.
+    if (!acl || acl->length == 0) {
+        if (tr::level(tr::INFO) == 1) tr::record_data(107, {tr::str(aclfname)});
+        return ACL_RC_INFO;
+    }
+    if (acl->length < 0 || !acl->value)
+        return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 2, acl);
+    return store(aclfname, {static_cast<size_t>(acl->length), put_buffer, acl}, force);
+}
+
+int32_t acl__cache_acltrees(const char *aclfname, const acl__trees_s *trees, sec_boolean_t force) {
+    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__cache_acltrees", 1, 0);
+    // Refusals of the trees come before any file is looked at, as when the
+    // compiled ACL is built first.
+    size_t total = 0;
+    if (int32_t rc = acl__acltrees_size(trees, &total)) return rc;
+    return store(aclfname, {total, put_trees, trees}, force);
 }

@@ -32,6 +32,10 @@ int32_t acl__lock_acl_file(const char *aclfname, int aclfdes, uint32_t flags);
 // ACL file's owner, group and mode.  0 written, 1 nothing to do, 37 failure.
 int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *acl,
                              sec_boolean_t force);
+// The same for the compiled ACL of `trees`, streamed to the file as it is
+// serialised instead of built whole in memory first.
+struct acl__trees_s;
+int32_t acl__cache_acltrees(const char *aclfname, const acl__trees_s *trees, sec_boolean_t force);
 
 // ---- Test seam between file operations ----------------------------------
 //

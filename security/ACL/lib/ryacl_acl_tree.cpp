@@ -231,6 +231,16 @@ uint64_t chunk(const char *s, size_t len, size_t depth) {
     return k;
 }
 
+// A range of the key array whose entries share their first d bytes.
+struct rtask {
+    size_t lo, n;
+    unsigned d;
+};
+// Ranges this small sort faster by comparison than by another pass.
+constexpr size_t kRadixMin = 64;
+// Sixteen levels of at most 255 ranges waiting each, and the one at work.
+constexpr size_t kRadixStack = 16 * 255 + 1;
+
 struct sorter {
     skey *a;
     const ent *ents;
@@ -303,7 +313,8 @@ struct sorter {
         }
     }
 
-    void sort(size_t n) {
+    // Multikey quicksort of [lo, lo + n), whose keys hold bytes 0 to 15.
+    void quicksort(size_t lo, size_t n) {
         struct task {
             size_t lo, n, depth;
             unsigned budget;
@@ -315,8 +326,7 @@ struct sorter {
         size_t sp = 0;
         unsigned budget0 = 2;
         for (size_t m = n; m > 1; m >>= 1) budget0 += 2;
-        load(0, n, 0);
-        task cur{0, n, 0, budget0, true};
+        task cur{lo, n, 0, budget0, true};
         for (;;) {
             while (cur.n > 1) {
                 if (cur.n <= 16) {
@@ -359,6 +369,64 @@ struct sorter {
             cur = stack[--sp];
         }
     }
+
+    // Byte d (0 to 15) of the key that `k` and `next` hold from depth 0.
+    static unsigned byte_at(const skey &x, unsigned d) {
+        const uint64_t w = d < 8 ? x.k : x.next;
+        return static_cast<unsigned>(w >> (56 - 8 * (d & 7))) & 0xff;
+    }
+
+    // Most significant byte first, in place (American flag sort): each pass
+    // moves a range's entries once into its buckets, where quicksort would
+    // move them once per halving.  Bytes every entry of a range shares are
+    // stepped over without moving anything.  Small ranges, and ranges tied
+    // through all sixteen bytes, go to quicksort, which begins at byte 0
+    // again: the keys are unchanged, so the order it makes is the same.
+    void sort(size_t n, rtask *stack) {
+        load(0, n, 0);
+        size_t sp = 0;
+        stack[sp++] = {0, n, 0};
+        size_t count[256], next[256];
+        while (sp) {
+            rtask t = stack[--sp];
+            for (;;) {
+                if (t.n <= kRadixMin || t.d >= 16) {
+                    quicksort(t.lo, t.n);
+                    break;
+                }
+                std::memset(count, 0, sizeof count);
+                for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(a[j], t.d)];
+                if (count[byte_at(a[t.lo], t.d)] == t.n) {
+                    ++t.d;
+                    continue;
+                }
+                size_t start[256];
+                for (size_t b = 0, at = t.lo; b < 256; ++b) {
+                    start[b] = next[b] = at;
+                    at += count[b];
+                }
+                for (unsigned b = 0; b < 256; ++b) {
+                    const size_t end = start[b] + count[b];
+                    while (next[b] < end) {
+                        skey v = a[next[b]];
+                        unsigned c = byte_at(v, t.d);
+                        while (c != b) {
+                            std::swap(v, a[next[c]++]);
+                            c = byte_at(v, t.d);
+                        }
+                        a[next[b]++] = v;
+                    }
+                }
+                // Bucket 0 holds keys that ended: equal texts, except that
+                // a NUL byte cannot occur inside an identifier, so they are
+                // equal through every byte and only insertion order is left.
+                if (count[0] > 1) quicksort(start[0], count[0]);
+                for (unsigned b = 1; b < 256; ++b)
+                    if (count[b] > 1) stack[sp++] = {start[b], count[b], t.d + 1};
+                break;
+            }
+        }
+    }
 };
 
 // Call f(index) for each present entry in order; f returns false to stop.
@@ -387,18 +455,26 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
         if (v.ents[i].flags & kPresent) ++tail;
     skey *keys = nullptr;
     if (tail) {
-        if (tail > SIZE_MAX / sizeof(skey)) return no_memory(fname, SIZE_MAX);
-        keys = static_cast<skey *>(acl__malloc(tail * sizeof(skey)));
-        if (!keys) return no_memory(fname, tail * sizeof(skey));
-        acl__advise_large(keys, tail * sizeof(skey));
+        // The keys and, behind them, the radix pass's list of ranges.
+        if (tail > (SIZE_MAX - kRadixStack * sizeof(rtask)) / sizeof(skey)) return no_memory(fname, SIZE_MAX);
+        const size_t bytes = tail * sizeof(skey) + kRadixStack * sizeof(rtask);
+        keys = static_cast<skey *>(acl__malloc(bytes));
+        if (!keys) return no_memory(fname, bytes);
+        acl__advise_large(keys, bytes);
         size_t m = 0;
         for (uint32_t i = sorted_upto; i < v.n; ++i)
             if (v.ents[i].flags & kPresent) keys[m++].i = i;
-        sorter{keys, v.ents, v.arena}.sort(tail);
+        sorter{keys, v.ents, v.arena}.sort(tail, reinterpret_cast<rtask *>(keys + tail));
     }
+    // The tail's entries and identifiers are reached in sorted order, which
+    // is no order in memory: fetched ahead, the misses overlap instead of
+    // each costing a full trip to memory.
+    constexpr size_t kAhead = 16;
     uint32_t i = 0;
     size_t j = 0;
     for (;;) {
+        if (j + 2 * kAhead < tail) __builtin_prefetch(&v.ents[keys[j + 2 * kAhead].i]);
+        if (j + kAhead < tail) __builtin_prefetch(v.arena + v.ents[keys[j + kAhead].i].id_off);
         while (i < sorted_upto && !(v.ents[i].flags & kPresent)) ++i;
         bool have_p = i < sorted_upto, have_t = j < tail;
         if (!have_p && !have_t) break;

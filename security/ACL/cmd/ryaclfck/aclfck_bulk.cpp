@@ -151,16 +151,14 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
         acl::set_error(ACL_RC_INFO, 162);
         print_error();
     } else if (flags & ACLFCK_CACHE) {
-        sec_acl_buffer_desc compiled{0, nullptr};
-        rc = sec__acltrees_to_acl(&trees, &compiled);
-        if (rc == 0) rc = sec__cache_aclbuffer(name, &compiled, 1);
+        // Streamed: the compiled ACL never needs its whole size in memory.
+        rc = acl__cache_acltrees(name, &trees, 1);
         // 1 means there was nothing to store and records nothing; a compiled
         // ACL is never empty, so it cannot arise here, and it is no failure.
         if (rc != 0 && rc != ACL_RC_INFO) {
             print_error();
             result = rc;
         }
-        std::free(compiled.value);
     }
 
     acl__free_trees(&trees);  // releases the last tree first
