@@ -4,8 +4,10 @@
 // with.  Not installed.
 #pragma once
 
+#include <bit>
 #include <cstddef>
 #include <cstdint>
+#include <cstring>
 
 // ---- Locale-independent text (POSIX locale case folding) ----------------
 
@@ -14,6 +16,54 @@
 int zo_strcasecmp_posix_1(const char *a, const char *b);
 int zo_strncasecmp_posix_1(const char *a, const char *b, size_t n);
 int zo_tolower_posix_1(int c);
+
+// The same folding for the hot paths (tree keys, evaluation walks).
+namespace zo {
+
+inline unsigned char fold(unsigned char c) {
+    return (c >= 'A' && c <= 'Z') ? static_cast<unsigned char>(c + 32) : c;
+}
+
+// Fold the ASCII capitals of eight bytes at once.
+inline uint64_t fold8(uint64_t x) {
+    constexpr uint64_t k7f = 0x7f7f7f7f7f7f7f7full, k80 = 0x8080808080808080ull;
+    const uint64_t low = x & k7f;
+    const uint64_t ge_a = low + 0x3f3f3f3f3f3f3f3full;  // high bit: byte >= 'A'
+    const uint64_t gt_z = low + 0x2525252525252525ull;  // high bit: byte > 'Z'
+    return x | (((ge_a & ~gt_z & ~x) & k80) >> 2);
+}
+
+inline uint64_t load8(const char *p) {
+    uint64_t v;
+    std::memcpy(&v, p, 8);
+    return v;
+}
+
+// zo_strcasecmp_posix_1's sign for texts whose lengths are known: a has a
+// NUL at alen, b one at blen (b may hold an earlier one, as a hostile
+// buffer can; the result is then still that of the byte-wise compare).
+// Eight bytes at a time while they agree; nothing past either NUL is read.
+inline int casecmp_len(const char *a, size_t alen, const char *b, size_t blen) {
+    const size_t m = (alen < blen ? alen : blen) + 1;
+    size_t i = 0;
+    for (; i + 8 <= m; i += 8) {
+        const uint64_t x = fold8(load8(a + i)) ^ fold8(load8(b + i));
+        if (x) {
+            // The lowest differing byte of a little-endian load is the first.
+            if constexpr (std::endian::native == std::endian::little)
+                i += static_cast<size_t>(std::countr_zero(x)) / 8;
+            break;
+        }
+    }
+    for (; i < m; ++i) {
+        const unsigned char x = static_cast<unsigned char>(a[i]), y = static_cast<unsigned char>(b[i]);
+        const int d = fold(x) - fold(y);
+        if (d != 0 || x == '\0') return d;
+    }
+    return 0;
+}
+
+}  // namespace zo
 
 // Canonical text of a 16-byte IPv6 address into `dst` (at least 65 bytes).
 // Equal addresses always give equal text.  Returns 0, or non-zero when dst

@@ -12,9 +12,7 @@ namespace {
 
 constexpr uint64_t kNsPerSec = 1000000000u;
 
-inline unsigned char fold(unsigned char c) {
-    return (c >= 'A' && c <= 'Z') ? static_cast<unsigned char>(c - 'A' + 'a') : c;
-}
+using zo::fold;
 
 }  // namespace
 

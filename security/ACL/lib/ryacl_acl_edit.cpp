@@ -11,7 +11,6 @@
 //
 // The caller's buffer may not have been validated: the sub-ACL found must
 // lie inside the block, and its reading is bounded by its own length.
-#include <bit>
 #include <cstdlib>
 #include <cstring>
 
@@ -104,28 +103,6 @@ struct scan_result {
     size_t size = 0;
     uint32_t count = 0;
 };
-// The tree's order (zo_strcasecmp_posix_1) of two texts of known lengths.
-// Bytes that are equal fold equal, so a common prefix is skipped a word at
-// a time and only the rest is compared; that keeps the one pass over a
-// large sub-ACL cheap.  Only whole words before the shorter text's end are
-// skipped, so the comparison never starts past either NUL.
-int order(const char *a, size_t alen, const char *b, size_t blen) {
-    const size_t n = alen < blen ? alen : blen;
-    size_t k = 0;
-    for (uint64_t wa, wb; k + 8 <= n; k += 8) {
-        std::memcpy(&wa, a + k, 8);
-        std::memcpy(&wb, b + k, 8);
-        if (wa != wb) {
-            // Start at the first byte that differs (the lowest one in a
-            // little-endian load).
-            if constexpr (std::endian::native == std::endian::little)
-                k += static_cast<size_t>(std::countr_zero(wa ^ wb)) / 8;
-            break;
-        }
-    }
-    return zo_strcasecmp_posix_1(a + k, b + k);
-}
-
 scan_result scan_sorted(const unsigned char *base, const located &where, const char *id) {
     scan_result r;
     const unsigned char *sub = base + where.off;
@@ -151,9 +128,9 @@ scan_result scan_sorted(const unsigned char *base, const located &where, const c
         if (end - pos - ACL_ENTRY_HDR_SIZE < idlen || idlen == 0) return r;
         const char *eid = reinterpret_cast<const char *>(sub + pos + ACL_ENTRY_HDR_SIZE);
         if (strnlen(eid, idlen) + 1 != idlen) return r;
-        if (prev && order(prev, prevlen, eid, idlen - 1) >= 0) return r;
+        if (prev && zo::casecmp_len(prev, prevlen, eid, idlen - 1) >= 0) return r;
         if (!placed) {
-            int c = order(id, idtextlen, eid, idlen - 1);
+            int c = zo::casecmp_len(id, idtextlen, eid, idlen - 1);
             if (c <= 0) {
                 placed = true;
                 r.match = c == 0;

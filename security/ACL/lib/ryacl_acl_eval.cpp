@@ -46,7 +46,7 @@ public:
     // Step to the next entry.  1: *perm and *id (null for an entry without
     // an identifier) describe it; 0: no entries left; otherwise the return
     // code of a corrupted entry, with the error recorded.
-    int32_t next(bool with_id, uint32_t *perm, const char **id) {
+    int32_t next(bool with_id, uint32_t *perm, const char **id, size_t *idtextlen = nullptr) {
         if (left_ == 0) return 0;
         if (end_ - cur_ < ACL_ENTRY_HDR_SIZE) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
         const size_t idlen = acl__load_le16(cur_ + 5);
@@ -60,6 +60,7 @@ public:
             if (idlen == 0 || text[idlen - 1] != '\0')
                 return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
             *id = text;
+            if (idtextlen) *idtextlen = idlen - 1;
         } else {
             *id = nullptr;
         }
@@ -122,17 +123,16 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
     }
 
     const bool ordered = acletype == SEC_ACLE_TYPE_USER;
+    const size_t idlen = std::strlen(id);
+    size_t eidlen = 0;
     int32_t r;
-    while ((r = walk.next(true, &eperm, &eid)) == 1) {
+    while ((r = walk.next(true, &eperm, &eid, &eidlen)) == 1) {
         int c;
-        if (handler) {
-            c = handler(id, eid);
-            // What a handler records is its own affair, never the caller's.
-            acl::clear_error();
-        } else {
-            c = zo_strcasecmp_posix_1(id, eid);
-        }
+        c = handler ? handler(id, eid) : zo::casecmp_len(id, idlen, eid, eidlen);
         if (c == 0) {
+            // What a handler records is its own affair, never the caller's;
+            // every other way out records its own error over it.
+            if (handler) acl::clear_error();
             *perm = eperm;
             return 0;
         }
@@ -167,13 +167,15 @@ int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uin
     bool matched = false;
     for (int32_t g = 0; g < count; ++g) {
         const char *name = static_cast<const char *>(groups[g].value);
+        const size_t namelen = std::strlen(name);
         entry_walk walk;
         if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
         uint32_t eperm = 0;
         const char *eid = nullptr;
+        size_t eidlen = 0;
         int32_t r;
-        while ((r = walk.next(true, &eperm, &eid)) == 1) {
-            int c = zo_strcasecmp_posix_1(name, eid);
+        while ((r = walk.next(true, &eperm, &eid, &eidlen)) == 1) {
+            int c = zo::casecmp_len(name, namelen, eid, eidlen);
             if (c == 0) {
                 result |= eperm;
                 matched = true;

@@ -106,24 +106,9 @@ bool sorted_type(unsigned t) { return t == SEC_ACLE_TYPE_USER || t == SEC_ACLE_T
 // The order and equality of zo_strcasecmp_posix_1: A-Z fold onto a-z, every
 // other byte compares as its unsigned value.
 
-inline unsigned char fold(unsigned char c) {
-    return (c >= 'A' && c <= 'Z') ? static_cast<unsigned char>(c + 32) : c;
-}
-
-// Fold the ASCII capitals of eight bytes at once.
-inline uint64_t fold8(uint64_t x) {
-    constexpr uint64_t k7f = 0x7f7f7f7f7f7f7f7full, k80 = 0x8080808080808080ull;
-    const uint64_t low = x & k7f;
-    const uint64_t ge_a = low + 0x3f3f3f3f3f3f3f3full;  // high bit: byte >= 'A'
-    const uint64_t gt_z = low + 0x2525252525252525ull;  // high bit: byte > 'Z'
-    return x | (((ge_a & ~gt_z & ~x) & k80) >> 2);
-}
-
-inline uint64_t load8(const char *p) {
-    uint64_t v;
-    std::memcpy(&v, p, 8);
-    return v;
-}
+using zo::fold;
+using zo::fold8;
+using zo::load8;
 
 bool fold_eq(const char *a, const char *b, size_t n) {
     size_t i = 0;
@@ -481,8 +466,9 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
         uint32_t next;
         if (have_p && have_t) {
             const ent &ep = v.ents[i], &et = v.ents[keys[j].i];
-            next = zo_strcasecmp_posix_1(v.arena + ep.id_off, v.arena + et.id_off) <= 0 ? i++
-                                                                                          : keys[j++].i;
+            next = zo::casecmp_len(v.arena + ep.id_off, ep.id_len, v.arena + et.id_off, et.id_len) <= 0
+                       ? i++
+                       : keys[j++].i;
         } else {
             next = have_p ? i++ : keys[j++].i;
         }
@@ -714,11 +700,12 @@ ent *scan(big_part *b, const new_entry &ne) {
 
 // Where the identifiers arrive in one direction, binary search finds an
 // entry without an index.  Returns its position or n.
-uint32_t find_ordered(const big_part *b, const char *id) {
+uint32_t find_ordered(const big_part *b, const char *id, size_t idlen) {
     uint32_t lo = 0, hi = b->n;
     while (lo < hi) {
         uint32_t mid = lo + (hi - lo) / 2;
-        int c = zo_strcasecmp_posix_1(b->arena + b->ents[mid].id_off, id);
+        const ent &e = b->ents[mid];
+        int c = zo::casecmp_len(b->arena + e.id_off, e.id_len, id, idlen);
         if (c == 0) return mid;
         if ((c < 0) != b->descending) lo = mid + 1;
         else hi = mid;
@@ -756,7 +743,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     } else {
         // Once neither direction holds the comparison tells nothing more.
         if (b->sorted_upto == i || b->descending)
-            last_cmp = zo_strcasecmp_posix_1(b->arena + b->ents[i - 1].id_off, ne.id);
+            last_cmp = zo::casecmp_len(b->arena + b->ents[i - 1].id_off, b->ents[i - 1].id_len, ne.id, ne.idlen);
         const bool in_run = (last_cmp < 0 && b->sorted_upto == i) || (last_cmp > 0 && b->descending);
         if (!b->idx && !in_run) {
             if (i > kScanMax) {
@@ -1045,7 +1032,7 @@ int32_t sec__del_acle_from_tree(const sec_acle_desc *acle, sec_acltree_t t) {
         size_t s = probe(b, ne, &found);
         if (found) at = slot_entry(b->idx[s]);
     } else if (ordered(b)) {
-        at = find_ordered(b, ne.id);
+        at = find_ordered(b, ne.id, ne.idlen);
     } else if (ent *e = scan(b, ne)) {
         at = static_cast<uint32_t>(e - b->ents);
     }
