@@ -27,14 +27,6 @@ namespace {
 using namespace fuzzmodel;
 using bytes = std::vector<unsigned char>;
 
-int32_t current_msgnum() {
-    zo_error_t *rec = nullptr;
-    zo_get_error_1(&rec);
-    int32_t n = rec ? rec->zo_msg_num : 0;
-    zo_rel_error_1(rec);
-    return n;
-}
-
 uint16_t ld16(const unsigned char *p) { return static_cast<uint16_t>(p[0] | (p[1] << 8)); }
 uint32_t ld32(const unsigned char *p) {
     return static_cast<uint32_t>(p[0]) | (static_cast<uint32_t>(p[1]) << 8) | (static_cast<uint32_t>(p[2]) << 16) |

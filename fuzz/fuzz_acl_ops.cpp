@@ -21,14 +21,6 @@ namespace {
 
 using namespace fuzzmodel;
 
-int32_t current_msgnum() {
-    zo_error_t *rec = nullptr;
-    zo_get_error_1(&rec);
-    int32_t n = rec ? rec->zo_msg_num : 0;
-    zo_rel_error_1(rec);
-    return n;
-}
-
 class input {
 public:
     input(const uint8_t *p, size_t n) : p_(p), n_(n) {}

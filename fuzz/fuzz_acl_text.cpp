@@ -27,14 +27,6 @@ namespace {
 
 using namespace fuzzmodel;
 
-int32_t current_msgnum() {
-    zo_error_t *rec = nullptr;
-    zo_get_error_1(&rec);
-    int32_t n = rec ? rec->zo_msg_num : 0;
-    zo_rel_error_1(rec);
-    return n;
-}
-
 bool is_token_byte(unsigned char c) { return c != 0 && c != '\n' && c != '\f' && c != '\r' && !std::isspace(c); }
 
 // What the parser hands out must be a token of the line as it stood: the

@@ -13,9 +13,19 @@
 #include <utility>
 #include <vector>
 
+#include "ry_zo.h"
 #include "ryacl.h"
 
 namespace fuzzmodel {
+
+// The message number the last failing call recorded (0 when none).
+inline int32_t current_msgnum() {
+    zo_error_t *rec = nullptr;
+    zo_get_error_1(&rec);
+    int32_t n = rec ? rec->zo_msg_num : 0;
+    zo_rel_error_1(rec);
+    return n;
+}
 
 // The stream failed checks are reported on: the process's standard error
 // as it was before quiet_library_streams.
