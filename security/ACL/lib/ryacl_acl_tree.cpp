@@ -402,9 +402,9 @@ struct sorter {
                         a[next[b]++] = v;
                     }
                 }
-                // Bucket 0 holds keys that ended: equal texts, except that
-                // a NUL byte cannot occur inside an identifier, so they are
-                // equal through every byte and only insertion order is left.
+                // Bucket 0 holds identifiers that end here (none holds a
+                // NUL): equal texts, which quicksort leaves in insertion
+                // order.
                 if (count[0] > 1) quicksort(start[0], count[0]);
                 for (unsigned b = 1; b < 256; ++b)
                     if (count[b] > 1) stack[sp++] = {start[b], count[b], t.d + 1};
