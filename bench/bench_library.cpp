@@ -13,6 +13,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <map>
 #include <string>
 #include <vector>
 
@@ -127,13 +128,17 @@ BENCHMARK(BM_EvalVsBareWalk)
 void BM_EvalThreads(benchmark::State &state) {
     const int n = static_cast<int>(state.range(0));
     const unsigned char type = state.range(1) ? 0x84 : 0x04;
-    static bytes acl;
-    static sec_buffer_desc d;
-    if (state.thread_index() == 0) {
+    // Built once, before any thread reads it: threads of one run start
+    // together, so a buffer rebuilt by the first thread would be read by
+    // the second while it changes.
+    static const std::map<int, bytes> acls = [] {
         sec__register_id_handler(SEC_ID_HANDLER_USER, "unix", same_handler);
-        acl = user_acl(n);
-        d = sec_buffer_desc{static_cast<int32_t>(acl.size()), acl.data()};
-    }
+        std::map<int, bytes> m;
+        for (int k : {10, 100, 1000, 10000}) m[k] = user_acl(k);
+        return m;
+    }();
+    const bytes &acl = acls.at(n);
+    sec_buffer_desc d{static_cast<int32_t>(acl.size()), const_cast<unsigned char *>(acl.data())};
     // Each thread asks for a different identifier in the upper half.
     const std::string id = user_id(n / 2 + state.thread_index() % (n / 2));
     for (auto _ : state) {
