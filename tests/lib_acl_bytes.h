@@ -35,8 +35,7 @@ struct ent { uint32_t perm; std::string id; };  // id empty: none (types 1 and 2
 
 // One sub-ACL; mech "" writes no mechanism.
 inline bytes subacl(unsigned type, const std::string &mech, const std::vector<ent> &entries) {
-    bytes b;
-    put(b, 0, 4);  // the length, filled in last
+    bytes b(4, 0);  // the length, filled in last
     b.push_back(static_cast<unsigned char>(type));
     put(b, static_cast<uint32_t>(entries.size()), 4);
     b.push_back(static_cast<unsigned char>(mech.empty() ? 0 : mech.size() + 1));
@@ -67,18 +66,14 @@ inline bytes worked_example() {
 // A valid host-order ACL with every multi-byte field reversed and the byte
 // ordering set to 1, walked here without the library.
 inline bytes reversed(bytes b) {
-    auto flip = [&](size_t off, size_t n) {
-        std::reverse(b.begin() + static_cast<long>(off), b.begin() + static_cast<long>(off + n));
-    };
+    auto flip = [&](size_t off, size_t n) { std::reverse(b.begin() + long(off), b.begin() + long(off + n)); };
     size_t pos = 5;
     for (uint32_t s = 0, nsub = get(b, 3, 2); s < nsub; ++s) {
         const uint32_t len = get(b, pos, 4), count = get(b, pos + 5, 4);
-        size_t e = pos + 10 + b[pos + 9];
-        for (uint32_t i = 0; i < count; ++i) {
-            const size_t next = e + 7 + get(b, e + 5, 2);
+        for (size_t i = 0, e = pos + 10 + b[pos + 9], next; i < count; ++i, e = next) {
+            next = e + 7 + get(b, e + 5, 2);
             flip(e + 1, 4);  // permission
             flip(e + 5, 2);  // identifier length
-            e = next;
         }
         flip(pos, 4);      // sub-ACL length
         flip(pos + 5, 4);  // entry count
@@ -99,9 +94,8 @@ inline sec_acle_desc entry(unsigned type, uint32_t perm, const char *mech, const
     return e;
 }
 
-// A heap copy in a descriptor, sized exactly, so a sanitizer sees any read
-// past the end; no bytes give the empty descriptor.  Release with
-// sec_release_acl or free.
+// A heap copy sized exactly, so a sanitizer sees any read past the end; no
+// bytes give the empty descriptor.  Release with sec_release_acl or drop.
 inline sec_buffer_desc own(const bytes &b) {
     if (b.empty()) return sec_buffer_desc{0, nullptr};
     sec_buffer_desc d{static_cast<int32_t>(b.size()), std::malloc(b.size())};
@@ -112,15 +106,11 @@ inline bytes view(const sec_buffer_desc &d) {
     const auto *p = static_cast<const unsigned char *>(d.value);
     return d.length > 0 && p ? bytes(p, p + d.length) : bytes{};
 }
-inline void drop(sec_buffer_desc &d) {
-    std::free(d.value);
-    d = {0, nullptr};
-}
+inline void drop(sec_buffer_desc &d) { std::free(d.value), d = {0, nullptr}; }
 
 // Mutants of a valid buffer: every bit flipped, every byte value (every
 // `step`-th) at the offsets given, every truncation.
-inline std::vector<bytes> mutants(const bytes &base, std::initializer_list<size_t> offsets,
-                                  unsigned step = 1) {
+inline std::vector<bytes> mutants(const bytes &base, std::initializer_list<size_t> offsets, unsigned step = 1) {
     std::vector<bytes> out;
     for (size_t i = 0; i < base.size() * 8; ++i) {
         out.push_back(base);
@@ -131,7 +121,7 @@ inline std::vector<bytes> mutants(const bytes &base, std::initializer_list<size_
             out.push_back(base);
             out.back()[off] = static_cast<unsigned char>(v);
         }
-    for (size_t n = 0; n < base.size(); ++n) out.emplace_back(base.begin(), base.begin() + static_cast<long>(n));
+    for (size_t n = 0; n < base.size(); ++n) out.emplace_back(base.begin(), base.begin() + long(n));
     return out;
 }
 

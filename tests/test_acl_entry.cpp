@@ -2,12 +2,8 @@
 // allocation failures: test_alloc_failures.)
 #include <gtest/gtest.h>
 
-#include <cstdlib>
-#include <cstring>
-#include <string>
-
+#include "lib_acl_bytes.h"
 #include "ryacl_acl_entry.h"
-#include "ryacl_test_support.h"
 
 namespace {
 
