@@ -1,0 +1,223 @@
+// The utility layer: the error formatter and message table, ASCII case
+// folding, IPv6 text, codeset conversion failures, and the trace component.
+// (Error records copied and restored, valid conversions: the thread test.)
+#include <arpa/inet.h>
+#include <errno.h>
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <map>
+#include <regex>
+#include <sstream>
+
+#include "ry_zo.h"
+#include "ry_zo_int.h"
+#include "ryacl.h"
+#include "ryacl_error.h"
+#include "ryacl_test_support.h"
+#include "ryacl_trace.h"
+#include "ryacl_utils.h"
+
+namespace {
+
+namespace tr = acl::trace;
+const size_t npos = std::string::npos;
+int sign(int v) { return (v > 0) - (v < 0); }
+
+TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
+    const std::string dir(3000, 'd'), name(1500, 'n');
+    zo_error_arg_t one{ZO_ERROR_ARG_CHAR_STR, {}}, num{ZO_ERROR_ARG_INT, {}};
+    one.zo_arg_value.zo_arg_char_str = const_cast<char *>("f");
+    num.zo_arg_value.zo_arg_int = 42;
+    const char *const *tbl = zo_mesgtbl_ryseclib_msg;
+    const std::pair<std::function<void()>, std::string> cases[] = {
+        // %s %d 0x%x: a pointer-sized value shows its low 32 bits.
+        {[] { acl::set_error(4, 88, "sec_create_acle", 5, 0xdeadbeefu); },
+         "\tFunction name: sec_create_acle\n\tPositional parameter number: 5\n\tParameter value: 0xdeadbeef\n"},
+        {[] { acl::set_error(36, 164, 0x2000); }, "(0x00002000) does not correspond"},       // %08x
+        {[] { acl::set_error(43, 161, 'g', "staff"); }, "ACLE type: g; ACLE identifier: staff.\n"},  // %c
+        {[] { acl::set_error(23, 91, "unit", -1, -2); }, "\tLine number: -1\n\tError code: -2\n"},
+        // 113 and 114 use only positions 2 and 3: the two values land there.
+        {[] { acl::set_error(43, 113, "security/ACL/lib/ryacl_acl", 812); }, "(security/ACL/lib/ryacl_acl:812)\n"},
+        {[&] { zo_set_error_1(43, nullptr, "no-such-catalog.cat", 1, 114, tbl[114], "file.c", 7); }, "(file.c:7)\n"},
+        // Fewer values than placeholders: the rest format as nothing, nothing more is read.
+        {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 88, tbl[88], 1, &one); },
+         "\tFunction name: f\n\tPositional parameter number: \n\tParameter value: 0x\n"},
+        // A value of another kind than asked for is shown as its own kind.
+        {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 127, tbl[127], 1, &num); }, "routine (42)\n"},
+        {[&] { acl::set_error(105, 153, dir.c_str(), name.c_str()); },
+         "Current working directory: " + dir + "\nACL file name: " + name + "\n"},
+        {[] { zo_set_error_1(1, nullptr, "no-such-catalog.cat", 1, 9, "100%% of %1$s; %z %1$q %0$s %9999$s end\n", "x"); },
+         "100% of x; %z %1$q %0$s  end\n"},
+        {[] { acl::set_error(4, 9999); }, "Bad message id for message set ryseclib_msg"},
+    };
+    for (const auto &[record, shows] : cases) {
+        record();
+        EXPECT_NE(rytest::error_text().find(shows), npos) << rytest::error_text();
+    }
+    acl::set_error(43, 113, "file.c", 1);  // a skipped position is a reserved record
+    zo_error_t *rec = nullptr;
+    ASSERT_EQ(zo_get_error_1(&rec), 0);
+    EXPECT_TRUE(rec->zo_arg_cnt == 3 && rec->zo_args[0].zo_arg_type == ZO_ERROR_ARG_RESERVED &&
+                rec->zo_args[1].zo_arg_type == ZO_ERROR_ARG_CHAR_STR && rec->zo_args[2].zo_arg_type == ZO_ERROR_ARG_INT);
+    zo_rel_error_1(rec);
+    char *none = reinterpret_cast<char *>(1);
+    zo_set_no_error_1();
+    EXPECT_TRUE(rytest::error_code() == 0 && zo_get_error_1(nullptr) && zo_get_errmsg_1(nullptr, &none) && !none);
+}
+
+TEST(ZoText, PosixCaseCompareFoldsAsciiOnlyAndNStopsAtN) {
+    // Behind an equal-folded prefix the sign is that of the folded bytes as
+    // unsigned values, and swapping the texts flips it.
+    for (int a = 1; a < 256; ++a) {
+        ASSERT_EQ(zo_tolower_posix_1(a), (a >= 'A' && a <= 'Z') ? a + 32 : a) << a;
+        for (int b = 1; b < 256; ++b) {
+            char x[3] = {'K', static_cast<char>(a), 0}, y[3] = {'k', static_cast<char>(b), 0};
+            int want = sign(zo_tolower_posix_1(a) - zo_tolower_posix_1(b));
+            ASSERT_TRUE(sign(zo_strcasecmp_posix_1(x, y)) == want && sign(zo_strcasecmp_posix_1(y, x)) == -want)
+                << a << " " << b;
+        }
+    }
+    char a[4] = {'a', 'b', 0, 'Q'}, b[4] = {'A', 'B', 0, 'r'};  // bytes past the NUL differ
+    EXPECT_LT(zo_strcasecmp_posix_1("ab", "ABC"), 0);
+    EXPECT_TRUE(zo_strncasecmp_posix_1("abcX", "ABCy", 3) == 0 && zo_strncasecmp_posix_1("abcX", "ABCy", 4) != 0);
+    EXPECT_TRUE(zo_strncasecmp_posix_1("x", "y", 0) == 0 && zo_strncasecmp_posix_1(a, b, 4) == 0);
+    EXPECT_NE(zo_strncasecmp_posix_1("ab", "ABC", 3), 0);  // length + 1 reaches the NUL
+}
+
+TEST(ZoText, Ipv6CanonicalFormWithinTheArea) {
+    // The longest zero run is compressed, the leftmost on a tie, never a
+    // single group; only mapped IPv4 shows dotted; a short area is refused.
+    struct { const char *in, *want; size_t area; } cases[] = {
+        {"0:0:0:0:0:0:0:0", "::", 65}, {"0:0:0:0:0:0:0:1", "::1", 65}, {"1:0:0:0:0:0:0:0", "1::", 65},
+        {"2001:0DB8:0:0:0:0:0:ABCD", "2001:db8::abcd", 65}, {"1:0:0:2:0:0:0:3", "1:0:0:2::3", 65},
+        {"1:0:0:2:0:0:3:4", "1::2:0:0:3:4", 65}, {"0:0:1:2:3:4:0:0", "::1:2:3:4:0:0", 65},
+        {"1:0:2:3:4:5:6:7", "1:0:2:3:4:5:6:7", 65}, {"::FFFF:0102:0304", "::ffff:1.2.3.4", 65},
+        {"::fffe:1.2.3.4", "::fffe:102:304", 65}, {"2001:db8::1", "2001:db8::1", 12}, {"2001:db8::1", "", 11}};
+    for (const auto &c : cases) {
+        unsigned char addr[16];
+        char out[65];
+        std::memset(out, '#', sizeof out);
+        ASSERT_EQ(inet_pton(AF_INET6, c.in, addr), 1) << c.in;
+        int rc = zo_ipaddr_ntop_1(addr, out, c.area);
+        EXPECT_TRUE(*c.want ? rc == 0 && std::string(out) == c.want : rc != 0 && out[0] == '#') << c.in;
+    }
+}
+
+TEST(ZoText, CodesetFailuresMapToCodesAndGrowthFailuresFreeTheOutput) {
+    for (const auto &[to, text] : {std::pair{true, "ab\x80" "cd"}, {false, "caf\xc3\xa9"}, {false, "ab\xc3"}}) {
+        size_t inlen = std::strlen(text) + 1, outlen = 0;
+        char *out = nullptr;
+        int32_t rc = (to ? acl__convert_to_utf8 : acl__convert_from_utf8)(text, &inlen, &out, &outlen);
+        EXPECT_TRUE(rc == 26 && rytest::error_msgnum() == 130 && !out) << text;
+    }
+    char *out = nullptr;
+    size_t outlen = 0;
+    EXPECT_EQ(acl__convert_to_utf8("x", nullptr, &out, &outlen), 23);  // no input length: argument fault 20
+    const std::string t = rytest::error_text();
+    EXPECT_TRUE(rytest::error_msgnum() == 91 && t.find("security/ACL/lib/ryacl_utils") != std::string::npos &&
+                t.find("Error code: 20") != std::string::npos) << t;
+
+    // ASCII to UCS-4 quadruples the size, so the output must grow; a failure
+    // at any growth frees what was built (the sanitizer build checks leaks).
+    static zo_iconv_t h = nullptr;  // handles are never closed; keep it reachable
+    ASSERT_EQ(zo_iconv_open_1("UCS-4BE", ZO_ICONV_FROM_UTF8, &h), 0);
+    const std::string in(100, 'a');
+    auto run = [&] {
+        size_t inlen = in.size() + 1, len = 0;
+        char *res = nullptr;
+        int rc = zo_iconv_str_1(h, 0, in.c_str(), &inlen, &res, &len);
+        if (rc == 0 && (len != 4 * inlen || std::string(res + 396, 4) != std::string("\0\0\0a", 4))) rc = -1;
+        std::free(res);
+        return rc;
+    };
+    ASSERT_EQ(run(), 0);
+    EXPECT_GE(rytest::for_each_alloc_failure(run, [](int32_t rc, long) { EXPECT_EQ(rc, ZO_ICONV_RC_NO_MEMORY); }), 2);
+}
+
+// Trace points of every kind, with the ids the library uses for them.
+int points() {
+    char area[33];
+    std::memset(area, 'x', sizeof area);  // no NUL anywhere
+    int32_t n = 7;
+    tr::api_entry(9, 11, {tr::str("/etc/a\"cl"), tr::str(nullptr), tr::val(n)});
+    tr::api_exit(13, 13, 14, 0, {tr::val(n)});   // success with a result
+    tr::api_exit(26, 26, 27, 43, {tr::val(n)});  // failure: the code only
+    tr::api_exit(43, 43, 6);
+    tr::api_release_exit(48);
+    tr::api_entry(97, 99, {tr::strn(area, sizeof area)});
+    tr::point(tr::ERRORS, 115, {tr::val(n), tr::val(n)});
+    tr::point(tr::INFO, 107, {tr::str("cache")});
+    tr::point(tr::INFO, 114, {tr::val(n)});
+    tr::point(tr::INFO, 104, {});
+    tr::perf_timer t1(1), t2(2);
+    t1.record(1, {tr::str("/etc/acl")});
+    t2.record(6, {});
+    acl__trace_unregister_component();
+    tr::point(tr::ERRORS, 108, {});  // after unregistration: not recorded
+    return 0;
+}
+
+// The first trace point registers while the slot holds an error (or, with
+// `empty`, none) and errno is set: both must come out unchanged.
+int slot(bool empty) {
+    char file[] = "security/ACL/lib/ryacl_acl";
+    if (!empty) acl::set_error(42, 97, file, 321);
+    const std::string before = rytest::error_text();
+    file[0] = 'X';  // the slot holds its own copy
+    errno = EDOM;   // reading the error text may have changed it
+    tr::point(tr::ERRORS, 115, {tr::str("x")});
+    tr::api_exit(13, 13, 42);
+    return errno != EDOM || rytest::error_text() != before || rytest::error_code() != (empty ? 0 : 42);
+}
+
+const int g_scenario = [] {
+    const char *s = std::getenv("RYTEST_TRACE_SCENARIO");
+    if (s) std::_Exit(std::strcmp(s, "points") == 0 ? points() : slot(std::strcmp(s, "noslot") == 0));
+    return 0;
+}();
+
+TEST(Trace, LevelsSelectThePointsRecordedAsLines) {
+    rytest::tmp_dir d;
+    const struct { const char *scenario, *levels; std::vector<unsigned> want; } cases[] = {
+        {"points", "", {}},
+        {"points", "API=0,all=0,Bogus=9", {}},
+        // Level 1: entry and exit ids; Info 107 only at 1.
+        {"points", "api=1,ERRORS=1,Info=1", {9, 13, 26, 43, 48, 97, 104, 107, 115}},
+        // Level 8: data points instead; Info 114 only above 7; Perf 8
+        // records point 0 but arms no timer of level 1 or 2.
+        {"points", "all=8", {0, 11, 14, 26, 43, 48, 99, 104, 114, 115}},
+        // Release exits at any API level; malformed entries ignored.
+        {"points", "perf=2,API=3,bogus=4,Errors=x,=5,Info", {0, 6, 48}},
+        {"points", "Perf=1,API=300", {0, 1, 11, 14, 26, 43, 48, 99}},  // 300 counts as 255
+        {"slot", "", {}}, {"slot", "all=8", {0, 13, 115}}, {"noslot", "", {}}, {"noslot", "all=8", {0, 13, 115}},
+    };
+    const std::regex record(R"(\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{6}Z pid=\d+ tid=\d+ _SEL (\d+)(.*))");
+    for (const auto &c : cases) {
+        const std::string scenario = c.scenario, levels = c.levels, file = d / (scenario + levels);
+        auto r = rytest::run({"/proc/self/exe"}, "", {"RYTEST_TRACE_SCENARIO=" + scenario, "RYACL_TRACE=" + levels,
+                                                      "RYACL_TRACE_FILE=" + file});
+        EXPECT_EQ(r.status, 0) << scenario << " " << levels << "\n" << r.err;
+        EXPECT_EQ(rytest::file_exists(file), !c.want.empty()) << levels;  // nothing recorded, no file
+        std::map<unsigned, std::string> items;  // after the id, each id once
+        std::vector<unsigned> ids;
+        std::istringstream in(c.want.empty() ? "" : rytest::read_file(file));
+        std::smatch m;
+        for (std::string line; std::getline(in, line); items[ids.back()] = m[2]) {
+            ASSERT_TRUE(std::regex_match(line, m, record)) << line;
+            ids.push_back(static_cast<unsigned>(std::stoul(m[1].str())));
+        }
+        std::sort(ids.begin(), ids.end());
+        EXPECT_EQ(ids, c.want) << levels;
+        if (scenario + levels != "pointsall=8") continue;
+        EXPECT_EQ(items[11], R"( "/etc/a\"cl" "" 7/0x7)");  // texts quoted, numbers in decimal and hex
+        EXPECT_EQ(items[14], " 0/0x0 7/0x7");                // success: code and result
+        EXPECT_EQ(items[26], " 43/0x2b");                    // failure: the code only
+        EXPECT_TRUE(std::regex_match(items[99], std::regex(" x:(78){33}"))) << items[99];  // the whole area, no more
+    }
+}
+
+}  // namespace
