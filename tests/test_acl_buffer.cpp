@@ -28,7 +28,7 @@ bytes compile(const acl__trees_s &trees, rc_msg want = {0, 0}) {
     const int32_t rc = sec__acltrees_to_acl(&trees, &acl);
     EXPECT_EQ(rc ? with_msg(rc) : rc_msg(0, 0), want);
     const bytes out = view(acl);
-    EXPECT_EQ(acl.value == nullptr, rc != 0);
+    EXPECT_EQ(acl.value == nullptr && acl.length == 0, rc != 0);
     std::free(acl.value);
     return out;
 }
