@@ -7,6 +7,8 @@
 #include <cstdlib>
 #include <cstring>
 #include <map>
+#include <memory>
+#include <random>
 #include <regex>
 #include <set>
 #include <sstream>
@@ -72,6 +74,32 @@ TEST(ZoText, PosixCaseCompareFoldsAsciiOnlyAndNStopsAtN) {
     EXPECT_TRUE(zo_strcasecmp_posix_1("ab", "ABC") < 0 && zo_strncasecmp_posix_1("abcX", "ABCy", 3) == 0 &&
                 zo_strncasecmp_posix_1("abcX", "ABCy", 4) != 0 && zo_strncasecmp_posix_1("x", "y", 0) == 0 &&
                 zo_strncasecmp_posix_1(a, b, 4) == 0 && zo_strncasecmp_posix_1("ab", "ABC", 3) != 0);
+}
+
+// The word-at-a-time compare of texts of known length (trees, edits and
+// evaluation use it) orders exactly as the byte-wise one, also when b holds
+// a NUL before its length (a hostile buffer), and reads nothing past either
+// terminator: each text sits in a heap block of exactly its size.
+TEST(ZoText, KnownLengthCompareAgreesWithByteWise) {
+    const char alphabet[] = "aAzZ@[`{0\x7f\x80\xc3\xff";
+    std::mt19937 rng(5);
+    auto text = [&](size_t len, bool nul) {
+        std::string t = "user0000";
+        t.resize(rng() % 2 ? len : len % 9);
+        for (size_t i = 8; i < t.size(); ++i) t[i] = alphabet[rng() % (sizeof alphabet - 1)];
+        if (nul && !t.empty() && rng() % 4 == 0) t[rng() % t.size()] = '\0';
+        return t;
+    };
+    for (int it = 0; it < 200000; ++it) {
+        std::string x = text(rng() % 26, false), y = it % 3 ? text(rng() % 26, true) : x;
+        if (it % 3 == 0 && !y.empty()) y[rng() % y.size()] ^= 0x20;  // the same text in another case
+        std::unique_ptr<char[]> a(new char[x.size() + 1]), b(new char[y.size() + 1]);
+        std::memcpy(a.get(), x.c_str(), x.size() + 1);
+        std::memcpy(b.get(), y.c_str(), y.size() + 1);
+        ASSERT_EQ(sign(zo::casecmp_len(a.get(), x.size(), b.get(), y.size())),
+                  sign(zo_strcasecmp_posix_1(a.get(), b.get())))
+            << it;
+    }
 }
 
 TEST(ZoText, Ipv6CanonicalFormWithinTheArea) {
