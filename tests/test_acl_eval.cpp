@@ -86,4 +86,26 @@ TEST(Evaluation, SingleEntriesAndGroups) {
     EXPECT_NE(rytest::error_text().find("type (16)"), std::string::npos);
 }
 
+// Buffers from outside: every bit flipped, every truncation, every value of
+// the counts' and lengths' low bytes, each in a block of exactly its size.
+// Evaluating and listing never read outside it (the sanitizer build checks).
+TEST(Evaluation, HostileBuffersStayInsideTheBlock) {
+    for (const bytes &m : mutants(kAcl, {3, 5, 10, 14, 17})) {
+        for (unsigned t : {1u, 2u, 4u, 8u, 0x84u, 0u}) {
+            std::string r = eval(m, t, t & 4 ? "unix" : "krb", t & 4 ? "carol" : "x/one", nullptr, {"wheel", "staff"});
+            // A failure zeroes the grant, or leaves it untouched when the header is refused.
+            ASSERT_TRUE(r.rfind("0/0 ", 0) == 0 || r.find(" 0 ") != std::string::npos ||
+                        r.find(" 57005 ") != std::string::npos)
+                << r;
+        }
+        sec_buffer_desc d = own(m);
+        sec_acle_list_desc list{};
+        if (sec_list_acl(&d, &list) != 0) {
+            EXPECT_EQ(list.count, 0);
+        }
+        sec_release_aclelist(&list);
+        drop(d);
+    }
+}
+
 }  // namespace
