@@ -92,4 +92,30 @@ TEST(CliCheck, OpenRefusesANameReplacedAfterVetting) {
     EXPECT_TRUE(open_vetted(name, vetted, &fd) == ACL_RC_BAD_FILE_NAME && fd == -1);
 }
 
+// In process: a memory failure is never a fault of the file, so it ends
+// the run with 6 and message 89 even under -c, from the option copies on.
+TEST(CliCheck, MemoryFailuresReport89AndEndTheRunEvenUnderContinue) {
+    auto quietly = [](auto f) {  // standard error dropped
+        int saved = dup(2), null = open("/dev/null", O_WRONLY);
+        dup2(null, 2);
+        auto r = f();
+        std::fflush(stderr);
+        dup2(saved, 2), close(saved), close(null);
+        return r;
+    };
+    char *argv[] = {const_cast<char *>("ryaclfck"), const_cast<char *>("-t"), const_cast<char *>("tpl"),
+                    const_cast<char *>("-f"), const_cast<char *>("/no/such/dir/acl"), nullptr};
+    optind = 0;                 // a fresh scan
+    rytest::alloc_fail_nth(2);  // -f's copy; -t's is the first
+    EXPECT_EQ(quietly([&] { return aclfck__main(5, argv); }), 6);  // no check, no message 148
+    rytest::alloc_fail_none();
+    EXPECT_EQ(rytest::error_msgnum(), 89);
+    rytest::tmp_dir d;
+    rytest::write_file(d / "acl", "n r\nx\nu unix bob r\nu unix BOB w\ne krb5 a r\ng staff r\no w\n");
+    long sites = rytest::for_each_alloc_failure(
+        [&] { return quietly([&] { return aclfck__bulk_aclfile((d / "acl").c_str(), nullptr, ACLFCK_CONTINUE); }); },
+        [&](int32_t rc, long nth) { EXPECT_TRUE(rc == ACL_RC_NO_MEMORY && rytest::error_msgnum() == 89) << nth; });
+    EXPECT_GT(sites, 2);
+}
+
 }  // namespace
