@@ -3,6 +3,7 @@
 #include <arpa/inet.h>
 #include <errno.h>
 #include <gtest/gtest.h>
+#include <nl_types.h>
 
 #include <cstdlib>
 #include <cstring>
@@ -57,6 +58,25 @@ TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
         record();
         EXPECT_NE(rytest::error_text().find(shows), npos) << rytest::error_text();
     }
+}
+
+// One source makes both the built-in table and the compiled catalog: they
+// agree slot for slot, and each numbered message prints its own id.
+TEST(ZoError, BuiltInTableAndCompiledCatalogAgree) {
+    EXPECT_STREQ(acl::msg_text(RYSECLIB_MSG_COUNT), zo_badid_ryseclib_msg);
+    EXPECT_STREQ(acl::msg_text(-1), zo_badid_ryseclib_msg);
+    nl_catd cat = catopen(RYACL_BINARY_DIR "/share/ryacl/ryseclib.cat", 0);
+    ASSERT_NE(cat, reinterpret_cast<nl_catd>(-1));
+    static const char kMissing[] = "";
+    for (int n = 1; n < RYSECLIB_MSG_COUNT; ++n) {
+        const std::string t = zo_mesgtbl_ryseclib_msg[n];
+        const char *c = catgets(cat, 1, n, kMissing);
+        EXPECT_TRUE(t.empty() ? c == kMissing : c != kMissing && t == c) << n;
+        // 88..145 print 4471-(n+13), 146 on 4471-(n+14); the help texts below 88 none.
+        const size_t id = t.find("4471-" + std::to_string(n <= 145 ? n + 13 : n + 14) + " ");
+        EXPECT_TRUE(t.empty() || id == (n < 88 ? npos : 0u)) << n;
+    }
+    catclose(cat);
 }
 
 TEST(ZoText, PosixCaseCompareFoldsAsciiOnlyAndNStopsAtN) {
