@@ -67,7 +67,7 @@ char *slot_string(error_slot &s, const char *src) {
 struct placeholder {
     size_t begin = 0, end = 0;  // the span in the text
     unsigned pos = 0;           // 1-based position
-    std::string spec;           // "%" flags width prec length conv, without "N$"
+    std::string directive;  // "%" flags width prec length conv, without "N$"
     char conv = 0;
     int length = 0;             // 0 none, 1 'l', 2 "ll", -1 'h'
 };
@@ -80,15 +80,15 @@ bool parse_placeholder(std::string_view t, size_t i, placeholder &ph) {
     while (j < t.size() && t[j] >= '0' && t[j] <= '9' && digits < 4) pos = pos * 10 + (t[j++] - '0'), ++digits;
     if (digits == 0 || pos == 0 || j >= t.size() || t[j] != '$') return false;
     ++j;
-    std::string spec = "%";
-    while (j < t.size() && std::strchr("-+ #0", t[j])) spec += t[j++];
+    std::string directive = "%";
+    while (j < t.size() && std::strchr("-+ #0", t[j])) directive += t[j++];
     int width = 0;
     while (j < t.size() && t[j] >= '0' && t[j] <= '9') {
         width = width * 10 + (t[j] - '0');
         if (width > kMaxWidth) width = kMaxWidth;
         ++j;
     }
-    if (width) spec += std::to_string(width);
+    if (width) directive += std::to_string(width);
     if (j < t.size() && t[j] == '.') {
         ++j;
         int prec = 0;
@@ -97,8 +97,8 @@ bool parse_placeholder(std::string_view t, size_t i, placeholder &ph) {
             if (prec > kMaxWidth) prec = kMaxWidth;
             ++j;
         }
-        spec += '.';
-        spec += std::to_string(prec);
+        directive += '.';
+        directive += std::to_string(prec);
     }
     int length = 0;
     if (j < t.size() && t[j] == 'h') length = -1, ++j;
@@ -110,7 +110,7 @@ bool parse_placeholder(std::string_view t, size_t i, placeholder &ph) {
     ph.end = j + 1;
     ph.pos = pos;
     ph.length = length;
-    ph.spec = spec;
+    ph.directive = directive;
     return true;
 }
 
@@ -265,11 +265,11 @@ void append_formatted(std::string &out, const placeholder &ph, const zo_error_t 
         if (wants_text) {
             // Width and precision apply, the text may be long: format it
             // straight into the output.
-            std::string spec = ph.spec + "s";
-            int need = std::snprintf(nullptr, 0, spec.c_str(), s);
+            std::string directive = ph.directive + "s";
+            int need = std::snprintf(nullptr, 0, directive.c_str(), s);
             if (need > 0) {
                 std::string tmp(static_cast<size_t>(need) + 1, '\0');
-                std::snprintf(tmp.data(), tmp.size(), spec.c_str(), s);
+                std::snprintf(tmp.data(), tmp.size(), directive.c_str(), s);
                 out.append(tmp.data(), static_cast<size_t>(need));
             }
         } else {
@@ -284,16 +284,16 @@ void append_formatted(std::string &out, const placeholder &ph, const zo_error_t 
                       : a.zo_arg_type == ZO_ERROR_ARG_LONG ? a.zo_arg_value.zo_arg_long
                                                            : a.zo_arg_value.zo_arg_long_long;
         if (ph.conv == 'c') {
-            n = std::snprintf(buf, sizeof buf, (ph.spec + "c").c_str(), static_cast<int>(static_cast<unsigned char>(v)));
+            n = std::snprintf(buf, sizeof buf, (ph.directive + "c").c_str(), static_cast<int>(static_cast<unsigned char>(v)));
         } else if (std::strchr("dixXu", ph.conv)) {
             // The value keeps the width it was recorded with: an int printed
             // with "%x" shows its 32 bits, not a sign-extended 64.
             if (a.zo_arg_type == ZO_ERROR_ARG_INT) {
-                std::string spec = ph.spec + std::string(1, ph.conv);
-                n = std::snprintf(buf, sizeof buf, spec.c_str(), static_cast<int>(v));
+                std::string directive = ph.directive + std::string(1, ph.conv);
+                n = std::snprintf(buf, sizeof buf, directive.c_str(), static_cast<int>(v));
             } else {
-                std::string spec = ph.spec + "ll" + std::string(1, ph.conv);
-                n = std::snprintf(buf, sizeof buf, spec.c_str(), v);
+                std::string directive = ph.directive + "ll" + std::string(1, ph.conv);
+                n = std::snprintf(buf, sizeof buf, directive.c_str(), v);
             }
         } else {
             n = std::snprintf(buf, sizeof buf, "%lld", v);
@@ -301,7 +301,7 @@ void append_formatted(std::string &out, const placeholder &ph, const zo_error_t 
         break;
     }
     case ZO_ERROR_ARG_DOUBLE:
-        if (std::strchr("fgeE", ph.conv)) n = std::snprintf(buf, sizeof buf, (ph.spec + ph.conv).c_str(), a.zo_arg_value.zo_arg_double);
+        if (std::strchr("fgeE", ph.conv)) n = std::snprintf(buf, sizeof buf, (ph.directive + ph.conv).c_str(), a.zo_arg_value.zo_arg_double);
         else n = std::snprintf(buf, sizeof buf, "%g", a.zo_arg_value.zo_arg_double);
         break;
     case ZO_ERROR_ARG_VOID_PTR:
