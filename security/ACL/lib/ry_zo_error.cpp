@@ -67,7 +67,7 @@ char *slot_string(error_slot &s, const char *src) {
 struct placeholder {
     size_t begin = 0, end = 0;  // the span in the text
     unsigned pos = 0;           // 1-based position
-    std::string directive;  // "%" flags width prec length conv, without "N$"
+    std::string directive;      // "%" flags width prec length conv, without "N$"
     char conv = 0;
     int length = 0;             // 0 none, 1 'l', 2 "ll", -1 'h'
 };
