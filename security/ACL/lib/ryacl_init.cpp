@@ -37,7 +37,16 @@ extern "C" void acl__state_init(void) {
     acl__state.capacity = 0;
 }
 
-void acl__state_ensure_init() { pthread_once(&acl__init_once_block, acl__state_init); }
+namespace {
+// Set once acl__state_init has run, so later calls cost one load.
+std::atomic<bool> state_ready{false};
+}  // namespace
+
+void acl__state_ensure_init() {
+    if (state_ready.load(std::memory_order_acquire)) return;
+    pthread_once(&acl__init_once_block, acl__state_init);
+    state_ready.store(true, std::memory_order_release);
+}
 
 int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_handler handler) {
     acl::trace::api_entry(74, 76,

@@ -68,9 +68,12 @@ RYACL_API int32_t acl__trace_unregister_component(void) {
 
 namespace acl::trace {
 
+std::atomic<bool> registered{false};
+
 void ensure_registered() {
     // pthread_once leaves errno alone on success; nothing to guard here.
     pthread_once(&acl__trace_register_once, register_once);
+    registered.store(true, std::memory_order_release);
 }
 
 item strn(const char *s, size_t max, const char *absent) {

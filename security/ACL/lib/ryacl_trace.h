@@ -3,6 +3,7 @@
 // A point that is off costs one once-check and one byte read.
 #pragma once
 
+#include <atomic>
 #include <cstddef>
 #include <cstdint>
 #include <initializer_list>
@@ -24,9 +25,12 @@ enum category : unsigned { ERRORS = 0, INFO = 1, API = 2, BUFFER = 3, PERF = 4 }
 
 // Run the registration once per process (pthread_once).
 void ensure_registered();
+// Set once the registration has run: after that the once-check is this one
+// load, without a call into pthread_once on every trace point.
+extern std::atomic<bool> registered;
 
 inline tr_detail_level_t level(category c) {
-    ensure_registered();
+    if (!registered.load(std::memory_order_acquire)) ensure_registered();
     return acl__trace_detail_levels[c];
 }
 
