@@ -196,16 +196,14 @@ int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
     return 0;
 }
 
-int32_t acl__acltrees_size(const acl__trees_s *trees, size_t *total) {
-    size_t nsub = 0;
-    *total = 0;
-    return acltrees_size(trees, "sec__acltrees_to_acl", total, &nsub);
+int32_t acl__acltrees_size(const acl__trees_s *trees, acl__acl_plan *plan) {
+    *plan = {};
+    return acltrees_size(trees, "sec__acltrees_to_acl", &plan->total, &plan->nsub);
 }
 
-int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__byte_sink *sink) {
+int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan, const acl__byte_sink *sink) {
     const char *fname = "sec__acltrees_to_acl";
-    size_t total = 0, nsub = 0;
-    if (int32_t rc = acltrees_size(trees, fname, &total, &nsub)) return rc;
+    const size_t total = plan.total, nsub = plan.nsub;
     // One record (at most a 7-byte header and a 65535-byte identifier field)
     // always fits; a quarter of a megabyte keeps the writes few and the
     // staging area in cache.

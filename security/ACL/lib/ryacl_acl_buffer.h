@@ -50,13 +50,19 @@ struct acl__byte_sink {
     int32_t (*put)(void *ctx, const unsigned char *p, size_t n);
     void *ctx;
 };
-// Size in bytes of the compiled ACL sec__acltrees_to_acl would build, with
-// the same refusals.
-int32_t acl__acltrees_size(const acl__trees_s *trees, size_t *total);
+// What the compiled ACL of a set of trees holds: its size in bytes and its
+// number of sub-ACLs.
+struct acl__acl_plan {
+    size_t total;
+    size_t nsub;
+};
+// The plan of the compiled ACL sec__acltrees_to_acl would build, with the
+// same refusals.
+int32_t acl__acltrees_size(const acl__trees_s *trees, acl__acl_plan *plan);
 // The same bytes as sec__acltrees_to_acl, streamed through a small staging
 // area instead of built whole: a compiled ACL written to a file never needs
-// its full size in memory.
-int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__byte_sink *sink);
+// its full size in memory.  `plan` is that of these trees, unchanged since.
+int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan, const acl__byte_sink *sink);
 // Read the sub-ACL at `subacl` (with `avail` bytes up to the end of the
 // block) back into a new tree; never reads past avail.
 int32_t sec__subacl_to_acltree(const unsigned char *subacl, size_t avail, sec_acltree_t *tree);

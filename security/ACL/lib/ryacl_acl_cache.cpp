@@ -282,8 +282,14 @@ int32_t put_buffer(const void *ctx, const acl__byte_sink *sink) {
     return sink->put(sink->ctx, static_cast<const unsigned char *>(acl->value), static_cast<size_t>(acl->length));
 }
 
+struct planned_trees {
+    const acl__trees_s *trees;
+    acl__acl_plan plan;
+};
+
 int32_t put_trees(const void *ctx, const acl__byte_sink *sink) {
-    return acl__acltrees_emit(static_cast<const acl__trees_s *>(ctx), sink);
+    const auto *p = static_cast<const planned_trees *>(ctx);
+    return acl__acltrees_emit(p->trees, p->plan, sink);
 }
 
 }  // namespace
@@ -304,7 +310,7 @@ int32_t acl__cache_acltrees(const char *aclfname, const acl__trees_s *trees, sec
     if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__cache_acltrees", 1, 0);
     // Refusals of the trees come before any file is looked at, as when the
     // compiled ACL is built first.
-    size_t total = 0;
-    if (int32_t rc = acl__acltrees_size(trees, &total)) return rc;
-    return store(aclfname, {total, put_trees, trees}, force);
+    planned_trees p{trees, {}};
+    if (int32_t rc = acl__acltrees_size(trees, &p.plan)) return rc;
+    return store(aclfname, {p.plan.total, put_trees, &p}, force);
 }
