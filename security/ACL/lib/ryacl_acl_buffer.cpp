@@ -112,7 +112,7 @@ int32_t write_subacl(sec_acltree_s *tree, writer *w, size_t size, size_t count, 
 
 // Size of the compiled ACL of every tree, refusing what its header cannot
 // describe.
-int32_t acltrees_size(const acl__trees_s *trees, const char *fname, size_t *total_out, size_t *nsub_out) {
+int32_t acltrees_size(const acl__trees_s *trees, const char *fname, acl__acl_plan *plan) {
     const int32_t n = trees ? trees->nooftrees : 0;
     uint64_t total = ACL_HDR_SIZE;
     size_t nsub = 0;
@@ -128,8 +128,7 @@ int32_t acltrees_size(const acl__trees_s *trees, const char *fname, size_t *tota
         if (nsub > ACL_MAX_SUBACLS || total > INT32_MAX)
             return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
     }
-    *total_out = static_cast<size_t>(total);
-    *nsub_out = nsub;
+    *plan = {static_cast<size_t>(total), nsub};
     return 0;
 }
 
@@ -181,13 +180,14 @@ int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
     if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
     acl->length = 0;
     acl->value = nullptr;
-    size_t total = 0, nsub = 0;
-    if (int32_t rc = acltrees_size(trees, fname, &total, &nsub)) return rc;
+    acl__acl_plan plan{};
+    if (int32_t rc = acltrees_size(trees, fname, &plan)) return rc;
+    const size_t total = plan.total;
     auto *buf = static_cast<unsigned char *>(acl__malloc(total));
     if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
     acl__advise_large(buf, total);
     writer w{buf, buf, total};
-    if (int32_t rc = write_acltrees(trees, nsub, &w, fname)) {
+    if (int32_t rc = write_acltrees(trees, plan.nsub, &w, fname)) {
         std::free(buf);
         return rc;
     }
@@ -198,12 +198,11 @@ int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
 
 int32_t acl__acltrees_size(const acl__trees_s *trees, acl__acl_plan *plan) {
     *plan = {};
-    return acltrees_size(trees, "sec__acltrees_to_acl", &plan->total, &plan->nsub);
+    return acltrees_size(trees, "sec__acltrees_to_acl", plan);
 }
 
 int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan, const acl__byte_sink *sink) {
     const char *fname = "sec__acltrees_to_acl";
-    const size_t total = plan.total, nsub = plan.nsub;
     // One record (at most a 7-byte header and a 65535-byte identifier field)
     // always fits; a quarter of a megabyte keeps the writes few and the
     // staging area in cache.
@@ -212,9 +211,9 @@ int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan,
     auto *stage = static_cast<unsigned char *>(acl__malloc(kStage));
     if (!stage) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(kStage));
     writer w{stage, stage, kStage, sink, kStage};
-    int32_t rc = write_acltrees(trees, nsub, &w, fname);
+    int32_t rc = write_acltrees(trees, plan.nsub, &w, fname);
     if (rc == 0) rc = w.flush();
-    if (rc == 0 && w.written != total) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    if (rc == 0 && w.written != plan.total) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
     std::free(stage);
     return rc;
 }
