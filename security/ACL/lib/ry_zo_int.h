@@ -8,6 +8,8 @@
 #include <cstddef>
 #include <cstdint>
 #include <cstring>
+#include <string>
+#include <string_view>
 
 // ---- Locale-independent text (POSIX locale case folding) ----------------
 
@@ -62,6 +64,13 @@ inline int casecmp_len(const char *a, size_t alen, const char *b, size_t blen) {
     }
     return 0;
 }
+
+// Control characters (0x00 to 0x1f but tab, and 0x7f) written as \xNN, so
+// bytes that came from a file never drive the terminal they are shown on.
+// Printable text, UTF-8 included, is unchanged.
+inline bool is_control(unsigned char c) { return (c < 0x20 && c != '\t') || c == 0x7f; }
+bool has_controls(std::string_view s);
+std::string escape_controls(std::string_view s);
 
 }  // namespace zo
 

@@ -42,6 +42,27 @@ int zo_tolower_posix_1(int c) {
     return (c >= 'A' && c <= 'Z') ? c - 'A' + 'a' : c;
 }
 
+bool zo::has_controls(std::string_view s) {
+    for (unsigned char c : s)
+        if (is_control(c)) return true;
+    return false;
+}
+
+std::string zo::escape_controls(std::string_view s) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    std::string out;
+    out.reserve(s.size());
+    for (unsigned char c : s) {
+        if (!is_control(c)) {
+            out.push_back(static_cast<char>(c));
+            continue;
+        }
+        const char esc[4] = {'\\', 'x', kHex[c >> 4], kHex[c & 15]};
+        out.append(esc, 4);
+    }
+    return out;
+}
+
 // RFC 5952 text: lower-case hex without leading zeros, the longest run of
 // two or more zero groups as "::" (the leftmost on a tie), and the
 // IPv4-mapped form ::ffff:a.b.c.d.  The longest result is 39 characters, so
