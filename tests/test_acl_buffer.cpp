@@ -106,7 +106,9 @@ TEST(AclBuffer, LimitsAreRefusedNotWrapped) {
         const std::string mech = (i < 65536 ? "m" : "M") + std::to_string(i % 65536);
         sec_acle_desc e = entry(U, 1, mech.c_str(), i < 65536 ? "u" : "v");
         ASSERT_EQ(sec__add_acle_to_trees(&e, &trees), 0);
-        if (i == 65534) EXPECT_EQ(get(compile(trees), 3, 2), 65535u);
+        if (i == 65534) {
+            EXPECT_EQ(get(compile(trees), 3, 2), 65535u);
+        }
     }
     EXPECT_TRUE(trees.nooftrees == 65536 && acl__tree_count(trees.trees[12345]) == 2);
     EXPECT_EQ(compile(trees, {ACL_RC_BAD_ACL, 167}), bytes{});
