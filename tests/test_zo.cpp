@@ -6,6 +6,7 @@
 #include <nl_types.h>
 #include <unistd.h>
 
+#include <array>
 #include <cstdlib>
 #include <cstring>
 #include <map>
@@ -49,6 +50,8 @@ TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
          "\tFunction name: f\n\tPositional parameter number: \n\tParameter value: 0x\n"},
         // A value of another kind than asked for is shown as its own kind.
         {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 127, tbl[127], 1, &num); }, "routine (42)\n"},
+        {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 91, tbl[91], 3, std::array{one, one, one}.data()); },
+         "\tLine number: f\n\tError code: f\n"},
         {[&] { acl::set_error(105, 153, dir.c_str(), name.c_str()); },
          "Current working directory: " + dir + "\nACL file name: " + name + "\n"},
         {[] { zo_set_error_1(1, nullptr, "none.cat", 1, 9, "100%% of %1$s; %z %1$q %0$s %9999$s end\n", "x"); },

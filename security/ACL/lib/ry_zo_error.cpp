@@ -67,7 +67,7 @@ void copy_bounded(char *dst, size_t cap, const char *src) {
     if (!src) src = "";
     size_t n = std::strlen(src);
     if (n >= cap) n = cap - 1;
-    std::memcpy(dst, src, n);
+    std::memmove(dst, src, n);  // a record made from the slot may be put back
     dst[n] = '\0';
 }
 
@@ -80,7 +80,7 @@ char *slot_string(error_slot &s, const char *src) {
     size_t n = std::strlen(src);
     if (n >= room) n = room - 1;
     char *dst = s.strings + s.strings_used;
-    std::memcpy(dst, src, n);
+    std::memmove(dst, src, n);
     dst[n] = '\0';
     s.strings_used += n + 1;
     return dst;
@@ -372,9 +372,10 @@ void put_arg(sink &out, const placeholder &ph, const zo_error_t &rec) {
     switch (a.zo_arg_type) {
     case ZO_ERROR_ARG_CHAR_STR: {
         const char *s = a.zo_arg_value.zo_arg_char_str ? a.zo_arg_value.zo_arg_char_str : "";
-        if (ph.conv == 's') put_text(out, ph, s);
-        else put_text(out, placeholder{}, s);  // a text where a number was expected: show the text
-        return;
+        if (ph.conv == 's') return put_text(out, ph, s);
+        placeholder plain;  // a text where a number was expected: show the text
+        plain.directive[0] = '%';
+        return put_text(out, plain, s);
     }
     case ZO_ERROR_ARG_INT:
     case ZO_ERROR_ARG_LONG:
