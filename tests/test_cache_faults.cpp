@@ -92,7 +92,7 @@ const fault kFaults[] = {
     {"cache:stat-acl", kStat, {EACCES, EIO, ELOOP}, 122, "svc.acl)"},
     {"cache:open", kOpen, {EACCES, ENOTDIR, EIO}, 122, "svc.acl)"},
     {"cache:open-write", kOpen, {EACCES, EROFS, ETXTBSY}, 138, "svc.acl.cacl)"},
-    {"cache:open-tmp", kOpen, {ENOSPC, EDQUOT, EROFS, EMFILE, EEXIST}, 138, "/svc.acl.cacl) for writing"},
+    {"cache:open-tmp", kOpen, {ENOSPC, EDQUOT, EROFS, EMFILE, EEXIST}, 138, "svc.acl."},
     {"cache:write", {__NR_write}, {ENOSPC, EDQUOT, EIO, EFBIG, 0}, 139, "only\n0 bytes out of a total of 4005"},
     {"cache:write", {}, {EFBIG}, 139, "only\n1000 bytes out of a total of 4005"},
     {"cache:fchown", {__NR_fchown, __NR_fchownat}, {EPERM, EROFS}, 141, "to user id"},

@@ -165,9 +165,10 @@ int32_t cache_writer::create_tmp() {
         // no permission, name too long) a longer name will not cure.
         if (errno != EEXIST && errno != EINTR) break;
     }
-    // The temporary name is random and never existed: the cache file is
-    // the name an administrator can act on (space, permissions, a plant).
-    return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
+    // The report names the temporary file, as the message's text says; its
+    // name is the cache file's plus a dot and hex digits, so it still points
+    // the reader at the directory and the file in question.
+    return acl::set_error(ACL_RC_FILE_ERROR, 138, tmpname);
 }
 
 // Write, then give the file its identity, then make it durable, all on the
