@@ -94,12 +94,13 @@ strings outcomes(const bytes &b) {
     for (int t : {1, 2, 4, 8, 16}) add("type " + std::to_string(t), list(d, t, t == 4 ? "UNIX" : nullptr));
     for (auto [t, id] : {std::pair{1, ""}, {2, ""}, {4, "alice"}, {4, "bob"}, {4, "zed"}, {8, "x"}}) {
         uint32_t perm = 7;
-        r.push_back("eval " + code(sec__single_acle_perm(&d, static_cast<unsigned char>(t), "unix", nullptr, id, &perm)) +
-                    " " + std::to_string(perm));
+        const std::string rc = code(sec__single_acle_perm(&d, static_cast<unsigned char>(t), "unix", nullptr, id, &perm));
+        r.push_back("eval " + rc + " " + std::to_string(perm));
     }
     sec_buffer_desc g[] = {{0, const_cast<char *>("staff")}, {0, const_cast<char *>("wheel")}};
     uint32_t perm = 7;
-    r.push_back("groups " + code(sec__group_acles_perm(&d, 2, g, &perm)) + " " + std::to_string(perm));
+    const std::string rc = code(sec__group_acles_perm(&d, 2, g, &perm));
+    r.push_back("groups " + rc + " " + std::to_string(perm));
     const struct { char kind; unsigned type; const char *mech, *id; } edits[] = {
         {'+', 4, "unix", "carol"}, {'+', 4, "unix", "alice"}, {'2', 4, "unix", "bob"}, {'-', 4, "unix", "bob"},
         {'+', 2, "", ""}, {'-', 2, "", ""}, {'+', 16, "", "ops"}, {'-', 16, "", "wheel"}, {'+', 8, "krb", "x"}};
@@ -112,7 +113,10 @@ strings outcomes(const bytes &b) {
                                              : o.kind == '2' ? sec_add_acle_to_acl2(&e, &c) : sec_add_acle_to_acl(&e, &c);
             const std::string what = std::string(1, o.kind) + o.id + " " + code(rc);
             if (rc) r.push_back(what + (view(c) == b ? "" : " changed the bytes"));
-            else add(what + " then valid " + code(sec_convert_acl_to_host(1, &c)), list(c));
+            else {
+                const std::string valid = code(sec_convert_acl_to_host(1, &c));
+                add(what + " then valid " + valid, list(c));
+            }
             drop(c);
         }
     acl__edit_direct_enabled = true;
