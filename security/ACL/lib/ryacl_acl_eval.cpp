@@ -35,6 +35,34 @@ int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, 97, "securit
 // NUL inside its own length (114 otherwise).
 bool id_ends(const acl__entry &e) { return e.idlen != 0 && e.id[e.idlen - 1] == '\0'; }
 
+// Walk on to the entry for which cmp gives 0.  An ordered walk (user and
+// group entries are stored in ascending order) ends at the first entry for
+// which it is negative.  1: *perm is the match's permission; 0: none;
+// otherwise a failure, recorded.  The walk and the entry are the function's
+// own, so they stay in registers; each comparison gets a loop of its own.
+template <class Cmp>
+int32_t match_entry(acl__entry_cursor<> walk, bool ordered, Cmp cmp, uint32_t *perm) {
+    acl__entry e;
+    int r;
+    while ((r = walk.next(&e)) == 1) {
+        if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+        const int c = cmp(e);
+        if (c == 0) {
+            *perm = e.perm;
+            return 1;
+        }
+        if (c < 0 && ordered) return 0;
+    }
+    return r < 0 ? corrupted(__LINE__) : 0;
+}
+
+// Without regard to case, the comparison of users and groups.
+int32_t match_name(const acl__entry_cursor<> &walk, const char *name, uint32_t *perm) {
+    const size_t len = std::strlen(name);
+    return match_entry(walk, true, [&](const acl__entry &e) { return zo::casecmp_len(name, len, e.id, e.idlen - 1u); },
+                       perm);
+}
+
 int32_t no_entry(unsigned type, const char *mech, const char *id) {
     return acl::set_error(ACL_RC_BAD_ACLE, 134, type, mech ? mech : "", id ? id : "");
 }
@@ -85,24 +113,16 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
         sec__get_id_handler(SEC_ID_HANDLER_USER, mech, &handler);
     }
 
-    const bool ordered = acletype == SEC_ACLE_TYPE_USER;
-    const size_t idlen = std::strlen(id);
-    while ((r = walk.next(&e)) == 1) {
-        if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
-        const int c = handler ? handler(id, e.id) : zo::casecmp_len(id, idlen, e.id, e.idlen - 1u);
-        if (c == 0) {
-            // What a handler records is its own affair, never the caller's;
-            // every other way out records its own error over it.
-            if (handler) acl::clear_error();
-            *perm = e.perm;
-            return 0;
-        }
-        // User entries are stored in ascending order: nothing after an
-        // entry that orders after the identity can match.
-        if (c < 0 && ordered) break;
-    }
-    if (r < 0) return corrupted(__LINE__);
-    return no_entry(type, mech, id);
+    uint32_t granted = 0;
+    const int32_t m = handler ? match_entry(walk, acletype == SEC_ACLE_TYPE_USER,
+                                            [&](const acl__entry &x) { return handler(id, x.id); }, &granted)
+                              : match_name(walk, id, &granted);
+    if (m != 1) return m ? m : no_entry(type, mech, id);
+    // What a handler records is its own affair, never the caller's; every
+    // other way out records its own error over it.
+    if (handler) acl::clear_error();
+    *perm = granted;
+    return 0;
 }
 
 int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uint32_t *perm) {
@@ -126,22 +146,15 @@ int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uin
     bool matched = false;
     for (int32_t g = 0; g < count; ++g) {
         const char *name = static_cast<const char *>(groups[g].value);
-        const size_t namelen = std::strlen(name);
         acl__entry_cursor<> walk(base, s, len);
         if (!walk.started()) return corrupted(__LINE__);
-        acl__entry e;
-        int r;
-        while ((r = walk.next(&e)) == 1) {
-            if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
-            const int c = zo::casecmp_len(name, namelen, e.id, e.idlen - 1u);
-            if (c == 0) {
-                result |= e.perm;
-                matched = true;
-                break;
-            }
-            if (c < 0) break;
+        uint32_t granted = 0;
+        const int32_t m = match_name(walk, name, &granted);
+        if (m > 1) return m;
+        if (m == 1) {
+            result |= granted;
+            matched = true;
         }
-        if (r < 0) return corrupted(__LINE__);
     }
     if (!matched) return no_entry(SEC_ACLE_TYPE_GROUP, nullptr, nullptr);
     *perm = result;
