@@ -74,18 +74,18 @@ void sec__dump_subacl(const unsigned char *subacl, size_t avail, const char *lea
         emit(stdout, false);
         return;
     }
-    const unsigned char type = subacl[4];
+    const acl__subacl s = acl__subacl_alone(subacl, avail);
     // The mechanism shown is bounded by the record's 17-byte field and by
     // the bytes present, whatever the length byte claims.
     char mech[17] = {};
-    if (acl__type_has_mech(type)) {
-        size_t n = subacl[9];
+    if (acl__type_has_mech(s.type)) {
+        size_t n = s.mechlen;
         if (n > avail - ACL_SUBACL_HDR_SIZE) n = avail - ACL_SUBACL_HDR_SIZE;
         if (n > sizeof mech - 1) n = sizeof mech - 1;
         std::memcpy(mech, subacl + ACL_SUBACL_HDR_SIZE, n);
     }
-    acl::set_error(ACL_RC_INFO, 84, leadspace, leadspace, static_cast<int32_t>(acl__load_le32(subacl)),
-                   static_cast<int>(type), mech, static_cast<int32_t>(acl__load_le32(subacl + 5)));
+    acl::set_error(ACL_RC_INFO, 84, leadspace, leadspace, static_cast<int32_t>(s.length), static_cast<int>(s.type),
+                   mech, static_cast<int32_t>(s.count));
     emit(stderr, true);
 
     sec_acltree_t tree = nullptr;
