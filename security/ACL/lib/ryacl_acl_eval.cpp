@@ -8,6 +8,7 @@
 
 #include "ry_zo_int.h"
 #include "ryacl_acl_buffer.h"
+#include "ryacl_acl_entry.h"
 #include "ryacl_error.h"
 #include "ryacl_init.h"
 #include "ryacl_trace.h"
@@ -73,10 +74,10 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
     if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__single_acle_perm", 6, 0);
     if (int32_t rc = check_acl(acl)) return rc;
     const unsigned acletype = type & 0x1fu;
-    if (acletype != SEC_ACLE_TYPE_UNAUTHENTICATED && acletype != SEC_ACLE_TYPE_ANYOTHER &&
-        acletype != SEC_ACLE_TYPE_USER && acletype != SEC_ACLE_TYPE_EXPANDED)
+    // Groups are evaluated only as a set.
+    if (!acl__valid_type(acletype) || acletype == SEC_ACLE_TYPE_GROUP)
         return acl::set_error(ACL_RC_BAD_ARGS, 115, type);
-    const bool named = acletype == SEC_ACLE_TYPE_USER || acletype == SEC_ACLE_TYPE_EXPANDED;
+    const bool named = acl__type_has_mech(acletype);
     if (named && (!mech || !*mech)) return acl::set_error(ACL_RC_BAD_ARGS, 116);
     if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, 117);
 
