@@ -40,9 +40,10 @@ bool id_ends(const acl__entry &e) { return e.idlen != 0 && e.id[e.idlen - 1] == 
 // group entries are stored in ascending order) ends at the first entry for
 // which it is negative.  1: *perm is the match's permission; 0: none;
 // otherwise a failure, recorded.  The walk and the entry are the function's
-// own, so they stay in registers; each comparison gets a loop of its own.
+// own and it is kept apart from its callers, so they stay in registers, a
+// handler's call included; each comparison gets a loop of its own.
 template <class Cmp>
-int32_t match_entry(acl__entry_cursor<> walk, bool ordered, Cmp cmp, uint32_t *perm) {
+[[gnu::noinline]] int32_t match_entry(acl__entry_cursor<> walk, bool ordered, Cmp cmp, uint32_t *perm) {
     acl__entry e;
     int r;
     while ((r = walk.next(&e)) == 1) {
