@@ -165,7 +165,9 @@ int32_t cache_writer::create_tmp() {
         // no permission, name too long) a longer name will not cure.
         if (errno != EEXIST && errno != EINTR) break;
     }
-    return acl::set_error(ACL_RC_FILE_ERROR, 138, tmpname);
+    // The temporary name is random and never existed: the cache file is
+    // the name an administrator can act on (space, permissions, a plant).
+    return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
 }
 
 // Write, then give the file its identity, then make it durable, all on the
