@@ -43,6 +43,7 @@ TEST(Validation, EachRuleWithItsCodeAndMessage) {
         {"sub-ACL longer than where the next starts", set(groups2, 5, groups2[5] + 1u), "42/97"},
         {"entry count past the end", set(group, 10, 200), "42/97"}, {"sub-ACL count past the end", set(group, 3, 2), "42/97"},
         {"sub-ACL length past the end", set(group, 8, 0x7f), "42/97"},
+        {"a sub-ACL of its header alone, then another", make_acl({subacl(2, "", {}), subacl(16, "", {{1, "staff"}})}), "0/0"},
         {"identifier cut by the end", bytes(group.begin(), group.end() - 1), "42/97"},
     };
     for (const auto &r : rows) {
