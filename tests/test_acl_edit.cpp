@@ -58,6 +58,10 @@ TEST(Edit, AddAdd2DeleteBytesAndCodes) {
     auto at = [&](size_t off, unsigned char v) { bytes b = ex; b[off] = v; return b; };
     for (auto [b, want] : {std::pair{at(0, 0x84), "42/100"}, {at(1, 2), "42/101"}, {at(2, 1), "42/102"}})
         EXPECT_EQ(apply(b, {{'+', 4, 1, "unix", "x", want}, {'-', 4, 0, "unix", "bob", want}}), b);
+    // A last sub-ACL whose length covers only its header is written back over all its entries: none stays behind.
+    bytes header_only = make_acl({subacl(16, "", {{1, "staff"}})});
+    header_only[5] = 10;
+    EXPECT_EQ(apply(header_only, {{'+', 16, 2, "", "wheel"}}), make_acl({subacl(16, "", {{1, "staff"}, {2, "wheel"}})}));
     std::vector<bytes> full(65535, subacl(2, "", {{1, ""}})), after = full;
     after[0] = subacl(2, "", {{3, ""}});
     EXPECT_EQ(apply(make_acl(full), {{'+', 16, 1, "", "g", "42/93"}, {'+', 2, 3, "", ""}}), make_acl(after));
