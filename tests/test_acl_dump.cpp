@@ -54,6 +54,11 @@ TEST(AclDump, UnreadableSubaclsAreReportedOnStdout) {
         EXPECT_EQ(t.first.rfind("ACL descriptor: " + std::to_string(n) + " byte(s) long\n", 0), 0u);
         EXPECT_NE(t.second.find("4471-110"), std::string::npos) << n;
     }
+    // Handed over alone, a sub-ACL one byte short of its header shows only the cut.
+    const bytes nine(full.begin() + 5, full.begin() + 14);
+    const captured alone = capture([&] { sec__dump_subacl(nine.data(), nine.size(), "\t"); });
+    EXPECT_EQ(alone.first, "");
+    EXPECT_NE(alone.second.find("4471-110"), std::string::npos) << alone.second;
     // A count that lies: reported, and the next sub-ACL still shown.
     bytes b = full;
     b[13] = 0x7f;
