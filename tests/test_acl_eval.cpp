@@ -80,6 +80,7 @@ TEST(Evaluation, SingleEntriesAndGroups) {
     EXPECT_EQ(eval(kAcl, 0x84, "unix", "Bob"), "43/134 0 alice,");
     EXPECT_EQ(eval(kAcl, 8, "krb", "x/one"), "0/0 256 x/two,x/one,");
     EXPECT_EQ(eval(kAcl, 0, nullptr, nullptr, nullptr, {"STAFF", "nobody", "adm"}), "0/0 5 ");
+    EXPECT_EQ(eval(kAcl, 0, nullptr, nullptr, nullptr, {"nobody", "wheel2"}), "43/134 0 ");  // none of the set is there
     EXPECT_EQ(eval(two_o, 0, nullptr, nullptr, nullptr, {"adm"}), "43/134 0 ");
     EXPECT_NE(rytest::error_text().find("type (16)"), std::string::npos);
 }
