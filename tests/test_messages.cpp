@@ -42,7 +42,7 @@ TEST(MessageNames, NameNumberAndArityAgreeWithTheTable) {
 }
 
 TEST(MessageNames, NamedAndNumberedRecordsAreTheSame) {
-    acl::set_error(ACL_RC_BAD_ARGS, 88, "fn", 2, 0x1234);
+    acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "fn", 2, 0x1234);
     const std::string numbered = rytest::error_text();
     acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "fn", 2, 0x1234);
     EXPECT_EQ(rytest::error_msgnum(), 88);

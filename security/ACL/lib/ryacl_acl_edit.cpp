@@ -39,17 +39,17 @@ constexpr size_t kMaxLength = INT32_MAX;
 int32_t take_entry(const sec_acle_desc *acle, sec_acle_desc *e) {
     std::memset(e, 0, sizeof *e);
     const unsigned type = acle->type;
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACLE, 103, type);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_TYPE, type);
     e->type = acle->type;
     e->perm = acle->perm;
     if (acl__type_has_mech(type)) {
         // An unterminated mechanism field is no mechanism.
         size_t mlen = strnlen(acle->mech, sizeof acle->mech);
         if (mlen == 0 || mlen == sizeof acle->mech || !acle->id)
-            return acl::set_error(ACL_RC_BAD_ACLE, 104, type);
+            return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_TYPE_NEEDS_MECH_OR_ID, type);
         std::memcpy(e->mech, acle->mech, mlen);
     }
-    if (type == SEC_ACLE_TYPE_GROUP && !acle->id) return acl::set_error(ACL_RC_BAD_ACLE, 104, type);
+    if (type == SEC_ACLE_TYPE_GROUP && !acle->id) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_TYPE_NEEDS_MECH_OR_ID, type);
     if (acl__type_has_id(type)) e->id = acle->id;
     return 0;
 }
@@ -57,13 +57,13 @@ int32_t take_entry(const sec_acle_desc *acle, sec_acle_desc *e) {
 // Header checks of an existing buffer.  A block shorter than the header is
 // not read.
 int32_t check_header(const sec_acl_buffer_desc *acl) {
-    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 93);
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_ACL);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (p[0] != ACL_BUF_TYPE) return acl::set_error(ACL_RC_BAD_ACL, 100);
-    if (p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 101);
-    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+    if (p[0] != ACL_BUF_TYPE) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BUFFER_TYPE);
+    if (p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BUFFER_VERSION);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     return 0;
 }
 
@@ -82,10 +82,10 @@ int32_t locate(const sec_acl_buffer_desc *acl, const sec_acle_desc *e, located *
     const size_t total = static_cast<size_t>(acl->length);
     const size_t off = static_cast<size_t>(sub - base);
     if (off < ACL_HDR_SIZE || total - off < ACL_SUBACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     const size_t len = acl__load_le32(sub);
     if (len > total - off || len < ACL_SUBACL_HDR_SIZE + size_t{sub[9]})
-        return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     *where = located{off, len};
     return 0;
 }
@@ -166,7 +166,7 @@ int32_t direct_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffe
     if (idlen - 1 > ACL_MAX_IDLEN || s.count == UINT32_MAX || grow > kMaxLength - total) return -1;
     const size_t newtotal = total + grow;
     auto *grown = static_cast<unsigned char *>(acl__realloc(base, newtotal));
-    if (!grown) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_add_acle_to_acl", newtotal);
+    if (!grown) return acl__no_memory("sec_add_acle_to_acl", newtotal);
     acl->value = base = grown;
     std::memmove(base + s.at + grow, base + s.at, total - s.at);
     unsigned char *ent = base + s.at;
@@ -186,7 +186,7 @@ int32_t direct_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffe
 int32_t shrink(sec_acl_buffer_t acl, size_t newtotal) {
     acl->length = static_cast<int32_t>(newtotal);
     void *smaller = acl__realloc(acl->value, newtotal);
-    if (!smaller) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_del_acle_from_acl", newtotal);
+    if (!smaller) return acl__no_memory("sec_del_acle_from_acl", newtotal);
     acl->value = smaller;
     return 0;
 }
@@ -261,15 +261,15 @@ int32_t splice(sec_acl_buffer_t acl, const located &where, const unsigned char *
     // The header counts sub-ACLs in 16 bits: a 65536th cannot be recorded,
     // so the ACL is refused as unable to take it.
     if (!where.off && acl__load_le16(base + 3) == ACL_MAX_SUBACLS)
-        return acl::set_error(ACL_RC_BAD_ACL, 93);
-    if (!where.off && !counted_subacls_fill(base, total)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_ACL);
+    if (!where.off && !counted_subacls_fill(base, total)) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     const size_t at = where.off ? where.off : total;
     if (freshlen > old) {
         const size_t grow = freshlen - old;
         if (grow > kMaxLength - total)
-            return acl::set_error(ACL_RC_NO_MEMORY, 89, who, kMaxLength);
+            return acl__no_memory(who, kMaxLength);
         auto *grown = static_cast<unsigned char *>(acl__realloc(base, total + grow));
-        if (!grown) return acl::set_error(ACL_RC_NO_MEMORY, 89, who, total + grow);
+        if (!grown) return acl__no_memory(who, total + grow);
         acl->value = base = grown;
     }
     std::memmove(base + at + freshlen, base + at + old, total - at - old);
@@ -299,7 +299,7 @@ int32_t tree_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffer_
     size_t freshlen = 0;
     if (!rc) {
         rc = sec__acltree_to_subacl(tree, &fresh, &freshlen);
-        if (!rc && !fresh) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, rc);
+        if (!rc && !fresh) rc = acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, rc);
     }
     sec__free_acltree(tree);
     if (!rc) rc = splice(acl, where, fresh, freshlen, "sec_add_acle_to_acl", false);
@@ -311,7 +311,7 @@ int32_t tree_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &wh
     sec_acltree_t tree = nullptr;
     int32_t rc = read_subacl(acl, where, &tree);
     if (!rc && acl__tree_count(tree) == 0)
-        rc = acl::set_error(ACL_RC_BAD_ACLE, 105, e->type, e->mech, e->id ? e->id : "");
+        rc = acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_NOT_IN_ACL, e->type, e->mech, e->id ? e->id : "");
     if (!rc) rc = sec__del_acle_from_tree(e, tree);
     unsigned char *fresh = nullptr;
     size_t freshlen = 0;
@@ -328,15 +328,15 @@ int32_t tree_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &wh
 bool direct_road(unsigned type) { return type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP; }
 
 int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_add_acle_to_acl", 1, 0);
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_add_acle_to_acl", 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_add_acle_to_acl", 1, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_add_acle_to_acl", 2, 0);
     sec_acle_desc e;
     if (int32_t rc = take_entry(acle, &e)) return rc;
 
     bool allocated = false;
     if (acl->length == 0 && !acl->value) {
         auto *p = static_cast<unsigned char *>(acl__malloc(ACL_HDR_SIZE));
-        if (!p) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_add_acle_to_acl", ACL_HDR_SIZE);
+        if (!p) return acl__no_memory("sec_add_acle_to_acl", ACL_HDR_SIZE);
         p[0] = ACL_BUF_TYPE;
         p[1] = ACL_BUF_VERSION;
         p[2] = ACL_BUF_HOST_ORDER;
@@ -365,15 +365,15 @@ int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl)
 }
 
 int32_t del_entry(sec_acle_t acle, sec_acl_buffer_t acl) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_del_acle_from_acl", 1, 0);
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_del_acle_from_acl", 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_del_acle_from_acl", 1, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_del_acle_from_acl", 2, 0);
     sec_acle_desc e;
     if (int32_t rc = take_entry(acle, &e)) return rc;
     if (int32_t rc = check_header(acl)) return rc;
     located where;
     if (int32_t rc = locate(acl, &e, &where)) return rc;
     if (!where.off)
-        return acl::set_error(ACL_RC_NO_MATCH, 105, e.type, e.mech, e.id ? e.id : "");
+        return acl::set_error(ACL_RC_NO_MATCH, acl::msg::ACLE_NOT_IN_ACL, e.type, e.mech, e.id ? e.id : "");
     int32_t rc = -1;
     if (direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
         rc = direct_del(&e, acl, where);

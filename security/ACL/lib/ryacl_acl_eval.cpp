@@ -21,11 +21,11 @@ using acl::trace::val;
 // header is refused before any byte of it is read.
 int32_t check_acl(const sec_acl_buffer_desc *acl) {
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (acl->length <= 0 || !p) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length <= 0 || !p) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
-    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
-    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     return 0;
 }
 
@@ -48,17 +48,17 @@ public:
     // code of a corrupted entry, with the error recorded.
     int32_t next(bool with_id, uint32_t *perm, const char **id, size_t *idtextlen = nullptr) {
         if (left_ == 0) return 0;
-        if (end_ - cur_ < ACL_ENTRY_HDR_SIZE) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        if (end_ - cur_ < ACL_ENTRY_HDR_SIZE) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         const size_t idlen = acl__load_le16(cur_ + 5);
         if (static_cast<size_t>(end_ - cur_ - ACL_ENTRY_HDR_SIZE) < idlen)
-            return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+            return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         *perm = acl__load_le32(cur_ + 1);
         const char *text = reinterpret_cast<const char *>(cur_ + ACL_ENTRY_HDR_SIZE);
         if (with_id) {
             // Handlers and comparisons get the identifier in place; it must
             // end inside its own length.
             if (idlen == 0 || text[idlen - 1] != '\0')
-                return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+                return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_ID_LENGTH, ACL_LOC_ACL);
             *id = text;
             if (idtextlen) *idtextlen = idlen - 1;
         } else {
@@ -76,33 +76,33 @@ private:
 };
 
 int32_t no_entry(unsigned type, const char *mech, const char *id) {
-    return acl::set_error(ACL_RC_BAD_ACLE, 134, type, mech ? mech : "", id ? id : "");
+    return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::NO_MATCH, type, mech ? mech : "", id ? id : "");
 }
 
 int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, const char *zmech,
                     const char *id, uint32_t *perm) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__single_acle_perm", 1, 0);
-    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__single_acle_perm", 6, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__single_acle_perm", 1, 0);
+    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__single_acle_perm", 6, 0);
     if (int32_t rc = check_acl(acl)) return rc;
     const unsigned acletype = type & 0x1fu;
     if (acletype != SEC_ACLE_TYPE_UNAUTHENTICATED && acletype != SEC_ACLE_TYPE_ANYOTHER &&
         acletype != SEC_ACLE_TYPE_USER && acletype != SEC_ACLE_TYPE_EXPANDED)
-        return acl::set_error(ACL_RC_BAD_ARGS, 115, type);
+        return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_EVAL_TYPE, type);
     const bool named = acletype == SEC_ACLE_TYPE_USER || acletype == SEC_ACLE_TYPE_EXPANDED;
-    if (named && (!mech || !*mech)) return acl::set_error(ACL_RC_BAD_ARGS, 116);
-    if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, 117);
+    if (named && (!mech || !*mech)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::MECH_REQUIRED);
+    if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::ID_REQUIRED);
 
     *perm = 0;
     unsigned char *sub = nullptr;
     sec__find_subacl(acl, static_cast<unsigned char>(acletype), zmech ? zmech : mech, &sub);
     if (!sub) return no_entry(type, mech, nullptr);
     entry_walk walk;
-    if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+    if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
 
     uint32_t eperm = 0;
     const char *eid = nullptr;
     if (!named) {
-        if (walk.count_left() > 1) return acl::set_error(ACL_RC_BAD_ACL, 109, ACL_LOC_ACL);
+        if (walk.count_left() > 1) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::SUBACL_SINGLE_REPEATED, ACL_LOC_ACL);
         // A sub-ACL of no entries (made outside the library) grants nothing
         // and is reported as a missing entry.
         int32_t r = walk.next(false, &eperm, &eid);
@@ -148,14 +148,14 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
 }
 
 int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uint32_t *perm) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 1, 0);
-    if (count != 0 && !groups) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 3, 0);
-    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 4, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 1, 0);
+    if (count != 0 && !groups) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 3, 0);
+    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 4, 0);
     if (int32_t rc = check_acl(acl)) return rc;
     // A name that is not there cannot be compared; refuse the array before
     // anything is written, the way a null array is refused.
     for (int32_t g = 0; g < count; ++g)
-        if (!groups[g].value) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 3, 0);
+        if (!groups[g].value) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 3, 0);
 
     *perm = 0;
     if (count == 0) return 0;
@@ -169,7 +169,7 @@ int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uin
         const char *name = static_cast<const char *>(groups[g].value);
         const size_t namelen = std::strlen(name);
         entry_walk walk;
-        if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         uint32_t eperm = 0;
         const char *eid = nullptr;
         size_t eidlen = 0;

@@ -27,11 +27,11 @@ int32_t check_acl(const sec_acl_buffer_desc *acl, bool *empty) {
         *empty = true;
         return 0;
     }
-    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     return 0;
 }
 
@@ -41,12 +41,12 @@ size_t subacl_length(const sec_acl_buffer_desc *acl, size_t off) {
     const auto *p = static_cast<const unsigned char *>(acl->value);
     const size_t total = static_cast<size_t>(acl->length);
     if (off > total || total - off < ACL_SUBACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         return 0;
     }
     const size_t len = acl__load_le32(p + off);
     if (len > total - off || len < ACL_SUBACL_HDR_SIZE + size_t{p[off + 9]}) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         return 0;
     }
     return len;
@@ -92,8 +92,8 @@ int32_t released_on_failure(int32_t rc, sec_acle_list_t list) {
 }
 
 int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 1, 0);
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 2, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 1, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 2, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;
@@ -104,16 +104,16 @@ int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
 
 int32_t list_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
                      sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 1, 0);
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 2, type);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 1, 0);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 2, type);
     const bool has_mech = acl__type_has_mech(type);
     if (has_mech && mech) {
         const size_t mlen = strnlen(mech, 17);
         if (mlen == 0 || mlen > 16)
-            return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 3,
+            return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 3,
                                   static_cast<const void *>(mech));
     }
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 4, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 4, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;

@@ -170,7 +170,7 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
 // A text whose length does not end at a NUL would have every scan run off
 // its end; it is refused as corrupted, and consumed whole.
 int32_t refuse_unterminated(char **tacl, size_t *length, int32_t *lineno) {
-    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, 131, *lineno);
+    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED, *lineno);
     *tacl = nullptr;
     *length = 0;
     if (*lineno < INT32_MAX) ++*lineno;

@@ -9,6 +9,7 @@
 
 #include "ry_zo_int.h"
 #include "ryacl.h"
+#include "ryacl_alloc.h"
 #include "ryacl_error.h"
 #include "ryacl_utils.h"
 #include "ryacl_utils_codeset.h"
@@ -52,7 +53,7 @@ void open_handle(uint32_t flags, zo_iconv_t *handle) {
 
 int32_t convert(zo_iconv_t handle, const char *fn, const char *in, size_t *inlen, char **out, size_t *outlen,
                 size_t *utf8_length) {
-    if (!handle) return acl::set_error(ACL_RC_CODESET, 129);
+    if (!handle) return acl::set_error(ACL_RC_CODESET, acl::msg::CODESET_INIT);
     // The location names the conversion call itself, so it is taken on its line.
     const source_loc at{ACL_LOC_UTILS}; const int zrc = zo_iconv_str_1(handle, 0, in, inlen, out, outlen);
     switch (zrc) {
@@ -60,17 +61,17 @@ int32_t convert(zo_iconv_t handle, const char *fn, const char *in, size_t *inlen
         return ACL_RC_OK;
     case ZO_ICONV_RC_BAD_HANDLE:
     case ZO_ICONV_RC_BAD_ARGS:
-        return acl::set_error(ACL_RC_INTERNAL, 91, at.file, at.line, zrc);
+        return acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, at.file, at.line, zrc);
     case ZO_ICONV_RC_NO_MEMORY: {
         // For the direction to UTF-8 the converter has put the size it
         // could not allocate into the output length; the caller gets its
         // output length back as it gave it.
         const size_t attempted = utf8_length ? *utf8_length : 0;
         *outlen = 0;
-        return acl::set_error(ACL_RC_NO_MEMORY, 89, fn, attempted);
+        return acl__no_memory(fn, attempted);
     }
     default:
-        return acl::set_error(ACL_RC_CODESET, 130);
+        return acl::set_error(ACL_RC_CODESET, acl::msg::CODESET_CONVERT);
     }
 }
 
