@@ -48,7 +48,7 @@ int cache_unusable(const struct stat &acl_st, const struct stat &c) {
 struct reader {
     const char *filename;
     const char *username;
-    sec_perm_set_t permtmpl;
+    const sec_perm_set_desc *permtmpl;
     sec_buffer_t acl;
     uint32_t flags;  // the working copy
     int32_t lineno = 0;
@@ -149,7 +149,7 @@ bool reader::take_cache() {
 int32_t reader::read_text() {
     acl__file_step("read:open", aclfname);
     int fd = open(aclfname, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, aclfname, errno);
+    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::FILE_OPEN, aclfname, errno);
     // Only the file whose type, owner and mode were checked is read: the
     // name may have come to denote another since (a link to a file the
     // caller never vetted, a FIFO, a device, a huge file).  The change time
@@ -162,7 +162,7 @@ int32_t reader::read_text() {
     if (frc != 0 || !same_file(fst, acl_st) || fst.st_ctim.tv_sec != acl_st.st_ctim.tv_sec ||
         fst.st_ctim.tv_nsec != acl_st.st_ctim.tv_nsec) {
         close(fd);
-        return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, err);
     }
     tr::point(tr::INFO, 119, {tr::str(aclfname)});
     tr::perf_timer step(2);
@@ -226,11 +226,11 @@ int32_t reader::run() {
     uid_t uid = 0;
     int32_t rc = sec__get_aclfname(filename, username, aclfname, &uid);
     if (rc) return rc;
-    if (stat(aclfname, &acl_st) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, errno);
-    if (!S_ISREG(acl_st.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, 0);
+    if (stat(aclfname, &acl_st) != 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, errno);
+    if (!S_ISREG(acl_st.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, 0);
     if (acl_st.st_size == 0) return 0;
     if (username && (acl_st.st_uid != uid || (acl_st.st_mode & 022)))
-        return acl::set_error(ACL_RC_PERMISSION, 128, aclfname, username);
+        return acl::set_error(ACL_RC_PERMISSION, acl::msg::FILE_NOT_OWNED, aclfname, username);
 
     tr::perf_timer choice(1);
     bool cache = choose_cache();
@@ -258,11 +258,11 @@ int32_t sec_read_acl_file(const char *filename, const char *username, sec_perm_s
     int32_t lineno = 0;
     uint32_t wflags = flags;
     if (!filename) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 1, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 1, 0);
     } else if (!acl) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 5, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 5, 0);
     } else if (username && !*username) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 121);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_USER_NAME);
     } else {
         acl->length = 0;
         acl->value = nullptr;

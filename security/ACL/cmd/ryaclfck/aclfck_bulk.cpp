@@ -27,7 +27,7 @@ void print_error() { acl::report_current_error(stderr, true); }
 // open; O_NOCTTY keeps a terminal from becoming ours.
 int32_t open_vetted(const char *name, const struct stat &vetted, int *fd) {
     *fd = open(name, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-    if (*fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 156, name, errno);
+    if (*fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CHECK_FILE_OPEN, name, errno);
     struct stat st;
     int err = 0;
     if (fstat(*fd, &st) != 0) {
@@ -43,7 +43,7 @@ int32_t open_vetted(const char *name, const struct stat &vetted, int *fd) {
     // between the lookup and the open, which no errno describes: 0.
     close(*fd);
     *fd = -1;
-    return acl::set_error(ACL_RC_BAD_FILE_NAME, 154, name, err);
+    return acl::set_error(ACL_RC_BAD_FILE_NAME, acl::msg::CHECK_FILE_BAD, name, err);
 }
 
 }  // namespace
@@ -55,14 +55,14 @@ int32_t aclfck__get_aclfile(const char *aclfname, const char *username, char *na
     if (rc != 0) return rc;
 
     struct stat st;
-    if (stat(name, &st) != 0) return acl::set_error(ACL_RC_BAD_FILE_NAME, 154, name, errno);
+    if (stat(name, &st) != 0) return acl::set_error(ACL_RC_BAD_FILE_NAME, acl::msg::CHECK_FILE_BAD, name, errno);
     // errno means nothing after a successful lookup: report 0 rather than
     // whatever an earlier call left behind.
-    if (!S_ISREG(st.st_mode)) return acl::set_error(ACL_RC_BAD_FILE_NAME, 154, name, 0);
+    if (!S_ISREG(st.st_mode)) return acl::set_error(ACL_RC_BAD_FILE_NAME, acl::msg::CHECK_FILE_BAD, name, 0);
     if (vetted) *vetted = st;
     if (!username) return 0;
     if (st.st_uid != uid || (st.st_mode & (S_IWGRP | S_IWOTH)) != 0)
-        return acl::set_error(ACL_RC_PERMISSION, 155, name, username);
+        return acl::set_error(ACL_RC_PERMISSION, acl::msg::CHECK_FILE_NOT_OWNED, name, username);
     return 0;
 }
 
@@ -97,7 +97,7 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
     }
     if (size == 0) {
         if (flags & ACLFCK_VERBOSE) {
-            acl::set_error(ACL_RC_INFO, 157, name);
+            acl::set_error(ACL_RC_INFO, acl::msg::FILE_EMPTY, name);
             print_error();
         }
         std::free(text);
@@ -144,11 +144,11 @@ int32_t aclfck__bulk_aclfile(const char *aclfname, const char *username, uint32_
 
     if (stopped) {
         if (flags & ACLFCK_CACHE) {
-            acl::set_error(ACL_RC_INFO, 162);
+            acl::set_error(ACL_RC_INFO, acl::msg::CACHE_SKIPPED);
             print_error();
         }
     } else if ((flags & ACLFCK_CACHE) && !clean) {
-        acl::set_error(ACL_RC_INFO, 162);
+        acl::set_error(ACL_RC_INFO, acl::msg::CACHE_SKIPPED);
         print_error();
     } else if (flags & ACLFCK_CACHE) {
         // Streamed: the compiled ACL never needs its whole size in memory.
