@@ -33,11 +33,19 @@ public:
     const unsigned char *current() {
         const char *name = nl_langinfo(NL_LOCALE_NAME(LC_CTYPE));
         if (!name) name = "";
-        if (!built_ || std::strncmp(name, name_, sizeof name_) != 0) build(name);
+        if (!built_ || !same_name(name)) build(name);
         return cls_;
     }
 
 private:
+    // Locale names are a few bytes: a loop beats a call.
+    bool same_name(const char *name) const {
+        size_t i = 0;
+        for (; name_[i] == name[i]; ++i)
+            if (name[i] == '\0') return true;
+        return false;
+    }
+
     void build(const char *name) {
         for (unsigned b = 0; b < 256; ++b) {
             unsigned char c = 0;
@@ -183,59 +191,69 @@ fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
     return permissions(lp, permset, acle);
 }
 
-// A text whose length does not end at a NUL would have every scan run off
-// its end; it is refused as corrupted, and consumed whole.
-int32_t refuse_unterminated(char **tacl, size_t *length, int32_t *lineno) {
-    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, 131, *lineno);
-    *tacl = nullptr;
-    *length = 0;
-    if (*lineno < INT32_MAX) ++*lineno;
-    return rc;
-}
-
 }  // namespace
 
-int32_t sec__read_acle_from_text(sec_perm_set_t permset, char **tacl, size_t *length,
-                                 int32_t *lineno, sec_acle_t acle) {
+int32_t acl__read_acle_deferred(sec_perm_set_t permset, char **tacl, size_t *length, int32_t *lineno,
+                                sec_acle_t acle, acl__line_fault *out) {
     std::memset(acle, 0, sizeof *acle);
     char *const start = *tacl;
     const size_t remaining = *length;
     // A NUL at the cursor is the end only when it is the text's final one;
     // an earlier one is a stray NUL, reported below as its line's fault.
     if (!start || remaining == 0) return 0;
-    if (start[remaining - 1] != '\0') return refuse_unterminated(tacl, length, lineno);
-    if (remaining == 1) return 0;
-    if (!permset) permset = &acl__default_perm_set;
-
-    line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
-    fault f = parse_entry(lp, permset, acle);
-    lp.find_end();
-
-    const size_t consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
     const int32_t line = *lineno;
-    if (consumed > LINE_MAX_BYTES) {
-        const int32_t len32 = consumed > INT32_MAX ? INT32_MAX : static_cast<int32_t>(consumed);
-        acl::trace::point(acl::trace::ERRORS, 115, {acl::trace::val(line), acl::trace::val(len32)});
-        f = {ACL_RC_FILE_ERROR, 145, nullptr};
-    }
-    if (lp.last) {
-        // Nothing after a NUL is parsed, so the text is used up either way.
-        if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, 131, nullptr};
+    fault f;
+    size_t consumed = 0;
+    if (start[remaining - 1] != '\0') {
+        // A text whose length does not end at a NUL would have every scan
+        // run off its end; it is refused as corrupted, and consumed whole.
+        f = {ACL_RC_BAD_ACL, 131, nullptr};
         *tacl = nullptr;
         *length = 0;
     } else {
-        *tacl = start + consumed;
-        *length = remaining - consumed;
+        if (remaining == 1) return 0;
+        if (!permset) permset = &acl__default_perm_set;
+
+        line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
+        f = parse_entry(lp, permset, acle);
+        lp.find_end();
+
+        consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
+        if (consumed > LINE_MAX_BYTES) f = {ACL_RC_FILE_ERROR, 145, nullptr};
+        if (lp.last) {
+            // Nothing after a NUL is parsed, so the text is used up either way.
+            if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, 131, nullptr};
+            *tacl = nullptr;
+            *length = 0;
+        } else {
+            *tacl = start + consumed;
+            *length = remaining - consumed;
+        }
     }
     if (*lineno < INT32_MAX) ++*lineno;
-
     if (f.rc == ACL_RC_OK) return 1;
+    *out = {f.rc, f.msg, line, f.token, consumed};
+    return f.rc;
+}
+
+int32_t acl__record_line_fault(const acl__line_fault &f) {
+    if (f.msg == 145) {
+        const int32_t len32 = f.length > INT32_MAX ? INT32_MAX : static_cast<int32_t>(f.length);
+        acl::trace::point(acl::trace::ERRORS, 115, {acl::trace::val(f.line), acl::trace::val(len32)});
+    }
     // A permission token that did not translate left message 133 behind;
     // the line's own message replaces it.
     acl::clear_error();
     switch (f.msg) {
-    case 132: return acl::set_error(f.rc, f.msg, f.token, line);
-    case 165: case 166: return acl::set_error(f.rc, f.msg, line, f.token);
-    default: return acl::set_error(f.rc, f.msg, line);
+    case 132: return acl::set_error(f.rc, f.msg, f.token, f.line);
+    case 165: case 166: return acl::set_error(f.rc, f.msg, f.line, f.token);
+    default: return acl::set_error(f.rc, f.msg, f.line);
     }
+}
+
+int32_t sec__read_acle_from_text(sec_perm_set_t permset, char **tacl, size_t *length,
+                                 int32_t *lineno, sec_acle_t acle) {
+    acl__line_fault f;
+    const int32_t rc = acl__read_acle_deferred(permset, tacl, length, lineno, acle, &f);
+    return rc == 0 || rc == 1 ? rc : acl__record_line_fault(f);
 }

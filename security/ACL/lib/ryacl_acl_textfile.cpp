@@ -13,6 +13,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <utility>
 
 #include "ryacl_acl_entry.h"
 #include "ryacl_acl_file.h"
@@ -77,41 +78,93 @@ int32_t acl__read_aclfile(acl__aclfile_s *f, char **text, size_t *size) {
     return rc;
 }
 
+namespace {
+
+// A batch of parsed lines: its entries, their lines and parts, and how the
+// batch ended (1: full, 0: end of text, else a faulty line's code, its
+// report kept in `fault`).
+struct line_batch {
+    static constexpr size_t kSize = 16;
+    sec_acle_desc acles[kSize];
+    acl__entry_parts parts[kSize];
+    int32_t lines[kSize];
+    size_t n = 0;
+    bool parted = false;  // parts filled
+    int32_t end = 1;
+    int32_t next_line = 1;  // the line after the batch
+    acl__line_fault fault;
+
+    void fill(const acl__textfile_opts &o, char **cursor, size_t *left, int32_t *lineno) {
+        n = 0;
+        end = 1;
+        while (n < kSize) {
+            end = acl__read_acle_deferred(o.permset, cursor, left, lineno, &acles[n], &fault);
+            if (end != 1) break;
+            if (acles[n].type == 0) continue;  // blank or comment line
+            lines[n++] = *lineno - 1;          // the parser has counted the line it consumed
+        }
+        next_line = *lineno;
+    }
+};
+
+}  // namespace
+
+// Lines are parsed a batch ahead of their entries' insertion, and the trees
+// fetch what a batch's insertions will touch while the batch before it is
+// inserted: on a shuffled file each insertion is otherwise a wait for
+// memory.  Everything a caller sees keeps the order of the lines: an entry
+// is handed to the sink and added in its turn, and a faulty line that ended
+// a batch is recorded only when its turn comes (its report was kept),
+// after every entry before it.  Nothing is parsed past a faulty line
+// before that line's turn.
 int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o, acl__text_sink &sink,
                            acl__trees_s *trees, acl__parse_result *res) {
     char *cursor = text;
     size_t left = size + 1;  // the terminating NUL counts
     res->lineno = 1;
     if (!text) return 0;
-    sec_acle_desc acle;
+    int32_t lineno = 1;
+    line_batch b[2];
+    line_batch *cur = &b[0], *ahead = &b[1];
+    cur->fill(o, &cursor, &left, &lineno);
+    cur->parted = acl__trees_prefetch(trees, cur->acles, cur->n, cur->parts);
     for (;;) {
-        std::memset(&acle, 0, sizeof acle);
-        int32_t rc = sec__read_acle_from_text(o.permset, &cursor, &left, &res->lineno, &acle);
-        if (rc == 0) return 0;
-        // The parser has counted the line it consumed.
-        const int32_t line = res->lineno - 1;
-        if (rc == 1) {
-            if (acle.type == 0) continue;  // blank or comment line
-            if (o.each_entry) sink.entry(acle, line);
-            rc = sec__add_acle_to_trees(&acle, trees);
-            if (rc == 0) {
+        ahead->n = 0;
+        if (cur->end == 1) {
+            ahead->fill(o, &cursor, &left, &lineno);
+            ahead->parted = acl__trees_prefetch(trees, ahead->acles, ahead->n, ahead->parts);
+        }
+        for (size_t k = 0; k < cur->n; ++k) {
+            const sec_acle_desc &acle = cur->acles[k];
+            res->lineno = cur->lines[k] + 1;
+            if (o.each_entry) sink.entry(acle, cur->lines[k]);
+            const int32_t add = cur->parted ? acl__add_parts_to_trees(cur->parts[k], trees)
+                                            : sec__add_acle_to_trees(&acle, trees);
+            if (add == 0) {
                 ++res->entries;
                 continue;
             }
-            sink.fault(rc, line);
-            if (rc == ACL_RC_BAD_ACLE && o.keep_going) {
+            sink.fault(add, cur->lines[k]);
+            if (add == ACL_RC_BAD_ACLE && o.keep_going) {
                 res->clean = false;
                 continue;
             }
-            return rc;
+            return add;
         }
-        sink.fault(rc, line);
-        // The parser allocates nothing today; should it ever fail for
-        // memory, that is no fault of the file and ends the parse anyway.
-        if (o.keep_going && rc != ACL_RC_NO_MEMORY) {
+        res->lineno = cur->next_line;
+        const int32_t rc = cur->end;
+        if (rc == 0) return 0;
+        if (rc != 1) {
+            acl__record_line_fault(cur->fault);
+            sink.fault(rc, cur->fault.line);
+            // The parser allocates nothing today; should it ever fail for
+            // memory, that is no fault of the file and ends the parse anyway.
+            if (!o.keep_going || rc == ACL_RC_NO_MEMORY) return rc;
             res->clean = false;
+            cur->fill(o, &cursor, &left, &lineno);
+            cur->parted = acl__trees_prefetch(trees, cur->acles, cur->n, cur->parts);
             continue;
         }
-        return rc;
+        std::swap(cur, ahead);
     }
 }

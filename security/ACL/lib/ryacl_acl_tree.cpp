@@ -354,12 +354,10 @@ const char *type_name(unsigned t) {
 // An entry to insert, its identifier's hash taken only when an index is
 // consulted.
 struct new_entry : acl__entry_parts {
-    mutable uint32_t hash = 0;
-    mutable bool hashed = false;
     explicit new_entry(const acl__entry_parts &p) : acl__entry_parts(p) {}
     uint32_t h() const {
-        if (!hashed) hash = fold_hash(id, idlen) & kHashMask, hashed = true;
-        return hash;
+        if (!hashed) idhash = acl__id_hash(id, idlen), hashed = true;
+        return idhash;
     }
 };
 
@@ -534,6 +532,7 @@ int32_t sec__add_acle_to_tree(sec_boolean_t single, const sec_acle_desc *acle, s
 }
 
 bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts) {
+    *parts = acl__entry_parts{};
     parts->type = acle->type;
     parts->perm = acle->perm;
     // The record's mechanism is a 17-byte field; one without its NUL is
@@ -555,6 +554,22 @@ bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mec
     if (!t || t->type != type) return false;
     if (!has_mech(type)) return true;
     return t->mechlen == mechlen && fold_eq(inline_bytes(t), mech, mechlen);
+}
+
+uint32_t acl__id_hash(const char *id, size_t idlen) { return fold_hash(id, idlen) & kHashMask; }
+
+void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
+    if (!t || !t->big) return;  // a one-entry tree is its own block
+    const big_part *b = t->big;
+    if (b->idx) {
+        __builtin_prefetch(&b->idx[slot_of(idhash, b->idx_mask)]);
+    } else {
+        // A small tree scans its entries: at most kScanMax of 16 bytes.
+        const char *e = reinterpret_cast<const char *>(b->ents);
+        for (size_t off = 0; off < size_t{b->n} * sizeof(ent); off += 64) __builtin_prefetch(e + off);
+    }
+    __builtin_prefetch(b->ents + b->n, 1);
+    __builtin_prefetch(b->arena + b->arena_len, 1);
 }
 
 uint32_t acl__tree_key_hash(const sec_acltree_s *t) {

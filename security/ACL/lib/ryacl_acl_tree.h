@@ -23,6 +23,7 @@
 #include "ryacl.h"
 
 struct sec_acltree_s;
+struct acl__entry_parts;
 typedef sec_acltree_s *sec_acltree_t;
 
 // The growable array of trees of an ACL under construction, one slot per
@@ -37,6 +38,15 @@ struct acl__trees_s {
 // Find or append the tree of the entry's sub-ACL and insert a copy of the
 // entry, refusing a duplicate (43 with message 160, 144 or 161).
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees);
+// Entries about to be added, in the order they will be: taken apart into
+// parts[0, n) and hashed, and what adding each will touch fetched into
+// cache, so that the misses of a batch overlap instead of coming one after
+// another.  Changes no tree.  False when an entry's type is none of the
+// five (parts from it on are not filled).
+bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
+                         acl__entry_parts *parts);
+// sec__add_acle_to_trees of an entry as parts (its hash kept).
+int32_t acl__add_parts_to_trees(const acl__entry_parts &parts, acl__trees_s *trees);
 // Release every tree (the last first) and the array; leaves it empty.
 void acl__free_trees(acl__trees_s *trees);
 
@@ -99,7 +109,18 @@ struct acl__entry_parts {
     size_t mechlen;
     const char *id;
     size_t idlen;
+    // The identifier's hash (acl__id_hash), once taken.
+    mutable uint32_t idhash = 0;
+    mutable bool hashed = false;
+    // The slot of its tree in the array of trees, once found (a slot keeps
+    // its tree for good).
+    int32_t tree_slot = -1;
 };
+// The hash the trees index an identifier by.
+uint32_t acl__id_hash(const char *id, size_t idlen);
+// Fetch into cache what inserting an identifier of that hash into the tree
+// will touch; changes nothing.
+void acl__tree_prefetch(const sec_acltree_s *tree, uint32_t idhash);
 // The parts of an entry record; false for a type that is none of the five.
 bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts);
 // acl__tree_insert with the entry as parts.

@@ -64,14 +64,56 @@ int32_t index_room(trees_index *x, acl__trees_s *trees, size_t more) {
     return 0;
 }
 
+// The slot of the tree of (type, mech), or -1; changes nothing.
+int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__entry_parts &ne) {
+    if (x->last >= 0 && x->last < trees->nooftrees &&
+        acl__tree_holds(trees->trees[x->last], ne.type, ne.mech, ne.mechlen))
+        return x->last;
+    if (!x->slots) return -1;
+    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
+    for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask) {
+        if (slot_hash(x->slots[s]) != h) continue;
+        const int32_t slot = static_cast<int32_t>(slot_entry(x->slots[s]));
+        if (acl__tree_holds(trees->trees[slot], ne.type, ne.mech, ne.mechlen)) return slot;
+    }
+    return -1;
+}
+
 }  // namespace
 
+bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
+                         acl__entry_parts *parts) {
+    for (size_t k = 0; k < n; ++k) {
+        if (!acl__entry_parts_of(&acles[k], &parts[k])) return false;
+        if (acl__type_has_id(parts[k].type)) {
+            parts[k].idhash = acl__id_hash(parts[k].id, parts[k].idlen);
+            parts[k].hashed = true;
+        }
+    }
+    const auto *x = trees ? static_cast<const trees_index *>(trees->index) : nullptr;
+    if (!x) return true;
+    // First every entry's tree, so the trees' blocks arrive together; then
+    // what each insertion reads in its tree.
+    for (size_t k = 0; k < n; ++k) {
+        parts[k].tree_slot = find_tree(trees, x, parts[k]);
+        if (parts[k].tree_slot >= 0) __builtin_prefetch(trees->trees[parts[k].tree_slot]);
+    }
+    for (size_t k = 0; k < n; ++k)
+        if (parts[k].tree_slot >= 0) acl__tree_prefetch(trees->trees[parts[k].tree_slot], parts[k].idhash);
+    return true;
+}
+
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
-    const char *fname = "sec__add_acle_to_trees";
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 1, 0);
-    if (!trees) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__add_acle_to_trees", 1, 0);
     acl__entry_parts ne;
     if (!acl__entry_parts_of(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, 103, acle->type);
+    return acl__add_parts_to_trees(ne, trees);
+}
+
+int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees) {
+    const char *fname = "sec__add_acle_to_trees";
+    if (!trees) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!acl__valid_type(ne.type)) return acl::set_error(ACL_RC_BAD_ACLE, 103, ne.type);
 
     auto *x = static_cast<trees_index *>(trees->index);
     if (!x) {
@@ -81,25 +123,16 @@ int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
         x->last = -1;
         trees->index = x;
     }
-    if (x->last >= 0 && x->last < trees->nooftrees &&
-        acl__tree_holds(trees->trees[x->last], ne.type, ne.mech, ne.mechlen))
-        return acl__tree_insert_parts(&trees->trees[x->last], 1, ne);
     // Index every tree before the first search (the array may have been
     // handed in already filled).
     if (!x->slots && trees->nooftrees > 0)
         if (int32_t rc = index_room(x, trees, 0)) return rc;
-
-    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
-    if (x->slots) {
-        for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask) {
-            if (slot_hash(x->slots[s]) != h) continue;
-            int32_t slot = static_cast<int32_t>(slot_entry(x->slots[s]));
-            if (acl__tree_holds(trees->trees[slot], ne.type, ne.mech, ne.mechlen)) {
-                x->last = slot;
-                return acl__tree_insert_parts(&trees->trees[slot], 1, ne);
-            }
-        }
+    const int32_t found = ne.tree_slot >= 0 && ne.tree_slot < trees->nooftrees ? ne.tree_slot : find_tree(trees, x, ne);
+    if (found >= 0) {
+        x->last = found;
+        return acl__tree_insert_parts(&trees->trees[found], 1, ne);
     }
+    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
 
     // A new sub-ACL: grow the index and the array first, so a failure
     // leaves both as they were.
