@@ -311,8 +311,10 @@ int32_t promote(tree **node, size_t more, size_t bytes) {
     const size_t keep = t->mechlen + 1u;
     size_t failed = 0;
     big_part nb{};
-    bool ok = acl__grow(&nb.ents, &nb.cap, more >= UINT32_MAX ? UINT32_MAX : 1 + more, &failed);
-    size_t want = inl + bytes < 64 ? 64 : inl + bytes;
+    // A tree that grows past one entry usually grows further: start with
+    // room for several, so a small tree is not reallocated at every step.
+    bool ok = acl__grow(&nb.ents, &nb.cap, more >= UINT32_MAX ? UINT32_MAX : (more < 7 ? 8 : 1 + more), &failed);
+    size_t want = inl + bytes < 256 ? 256 : inl + bytes;
     if (ok) ok = acl__grow(&nb.arena, &nb.arena_cap,
                             want > UINT32_MAX ? UINT32_MAX : want, &failed);
     tree *nt = nullptr;

@@ -26,6 +26,7 @@ struct trees_index {
     uint32_t used;
     size_t cap;   // capacity of the trees array
     int32_t last; // slot of the previous insertion, checked first
+    uint32_t last_hash;  // its key's hash
 };
 
 void index_put(trees_index *x, uint64_t v) {
@@ -64,13 +65,21 @@ int32_t index_room(trees_index *x, acl__trees_s *trees, size_t more) {
     return 0;
 }
 
+// The first index slot whose key hash is h: the slot of the tree of that
+// key, unless two keys share a hash; -1 when none.  Reads the index only.
+int32_t candidate(const trees_index *x, uint32_t h) {
+    for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask)
+        if (slot_hash(x->slots[s]) == h) return static_cast<int32_t>(slot_entry(x->slots[s]));
+    return -1;
+}
+
 // The slot of the tree of (type, mech), or -1; changes nothing.
 int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__entry_parts &ne) {
-    if (x->last >= 0 && x->last < trees->nooftrees &&
+    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
+    if (x->last >= 0 && x->last < trees->nooftrees && h == x->last_hash &&
         acl__tree_holds(trees->trees[x->last], ne.type, ne.mech, ne.mechlen))
         return x->last;
     if (!x->slots) return -1;
-    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
     for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask) {
         if (slot_hash(x->slots[s]) != h) continue;
         const int32_t slot = static_cast<int32_t>(slot_entry(x->slots[s]));
@@ -83,6 +92,9 @@ int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__en
 
 bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
                          acl__entry_parts *parts) {
+    constexpr size_t kMax = 64;
+    uint32_t keys[kMax];
+    if (n > kMax) n = kMax;
     for (size_t k = 0; k < n; ++k) {
         if (!acl__entry_parts_of(&acles[k], &parts[k])) return false;
         if (acl__type_has_id(parts[k].type)) {
@@ -91,13 +103,26 @@ bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, 
         }
     }
     const auto *x = trees ? static_cast<const trees_index *>(trees->index) : nullptr;
-    if (!x) return true;
-    // First every entry's tree, so the trees' blocks arrive together; then
-    // what each insertion reads in its tree.
+    if (!x || !x->slots) return true;
+    // Each step reads what the step before fetched, for the whole batch at
+    // once, so that the batch's misses overlap at every step: the index
+    // slot of the entry's sub-ACL, the array slot, the tree's block, what
+    // the insertion reads in the tree.  The tree found is a hint, checked
+    // when the entry is added (two keys may share a hash).
     for (size_t k = 0; k < n; ++k) {
-        parts[k].tree_slot = find_tree(trees, x, parts[k]);
-        if (parts[k].tree_slot >= 0) __builtin_prefetch(trees->trees[parts[k].tree_slot]);
+        keys[k] = acl__subacl_key_hash(parts[k].type, parts[k].mech, parts[k].mechlen);
+        __builtin_prefetch(&x->slots[slot_of(keys[k], x->mask)]);
     }
+    for (size_t k = 0; k < n; ++k) {
+        parts[k].tree_slot = k > 0 && keys[k] == keys[k - 1] ? parts[k - 1].tree_slot : candidate(x, keys[k]);
+        if (parts[k].tree_slot >= 0) __builtin_prefetch(&trees->trees[parts[k].tree_slot]);
+    }
+    for (size_t k = 0; k < n; ++k)
+        if (parts[k].tree_slot >= 0) {
+            const char *t = reinterpret_cast<const char *>(trees->trees[parts[k].tree_slot]);
+            __builtin_prefetch(t);
+            __builtin_prefetch(t + 64);
+        }
     for (size_t k = 0; k < n; ++k)
         if (parts[k].tree_slot >= 0) acl__tree_prefetch(trees->trees[parts[k].tree_slot], parts[k].idhash);
     return true;
@@ -127,12 +152,16 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     // handed in already filled).
     if (!x->slots && trees->nooftrees > 0)
         if (int32_t rc = index_room(x, trees, 0)) return rc;
-    const int32_t found = ne.tree_slot >= 0 && ne.tree_slot < trees->nooftrees ? ne.tree_slot : find_tree(trees, x, ne);
+    const int32_t found = ne.tree_slot >= 0 && ne.tree_slot < trees->nooftrees &&
+                                  acl__tree_holds(trees->trees[ne.tree_slot], ne.type, ne.mech, ne.mechlen)
+                              ? ne.tree_slot
+                              : find_tree(trees, x, ne);
+    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
     if (found >= 0) {
         x->last = found;
+        x->last_hash = h;
         return acl__tree_insert_parts(&trees->trees[found], 1, ne);
     }
-    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
 
     // A new sub-ACL: grow the index and the array first, so a failure
     // leaves both as they were.
@@ -156,6 +185,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
     ++x->used;
     x->last = slot;
+    x->last_hash = h;
     return 0;
 }
 
