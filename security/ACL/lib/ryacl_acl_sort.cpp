@@ -3,6 +3,7 @@
 // quicksort of what is still tied.
 #include "ryacl_acl_sort.h"
 
+#include <bit>
 #include <cstring>
 #include <utility>
 
@@ -186,6 +187,19 @@ struct sorter {
         return static_cast<unsigned>(w >> (56 - 8 * (d & 7))) & 0xff;
     }
 
+    // How many of the sixteen key bytes every entry of [lo, lo + n) shares
+    // with the first, knowing that the first `from` are shared.
+    unsigned shared_bytes(size_t lo, size_t n, unsigned from) const {
+        uint64_t dk = 0, dn = 0;
+        for (size_t j = lo + 1; j < lo + n; ++j) {
+            dk |= a[j].k ^ a[lo].k;
+            dn |= a[j].next ^ a[lo].next;
+        }
+        const unsigned same = dk ? static_cast<unsigned>(std::countl_zero(dk)) / 8
+                                 : 8 + (dn ? static_cast<unsigned>(std::countl_zero(dn)) / 8 : 8);
+        return same > from ? same : from;
+    }
+
     // Most significant byte first, in place (American flag sort): each pass
     // moves a range's entries once into its buckets, where quicksort would
     // move them once per halving.  Bytes every entry of a range shares are
@@ -207,7 +221,10 @@ struct sorter {
                 std::memset(count, 0, sizeof count);
                 for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(a[j], t.d)];
                 if (count[byte_at(a[t.lo], t.d)] == t.n) {
-                    ++t.d;
+                    // One shared byte: find in one pass how many the whole
+                    // range shares ("user0..." shares five), rather than a
+                    // counting pass for each.
+                    t.d = shared_bytes(t.lo, t.n, t.d + 1);
                     continue;
                 }
                 size_t start[256];

@@ -558,6 +558,8 @@ bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mec
     return t->mechlen == mechlen && fold_eq(inline_bytes(t), mech, mechlen);
 }
 
+const size_t acl__tree_head_bytes = sizeof(tree) + sizeof(big_part) + kMechMax + 1;
+
 uint32_t acl__id_hash(const char *id, size_t idlen) { return fold_hash(id, idlen) & kHashMask; }
 
 void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {

@@ -133,6 +133,9 @@ inline uint32_t acl__subacl_key_hash(unsigned char type, const char *mech, size_
     return zo::fold_hash(mech, mechlen, type);
 }
 uint32_t acl__tree_key_hash(const sec_acltree_s *tree);
+// Bytes from a tree's start that finding it reads (its header and the
+// first entry's mechanism), for fetching ahead.
+extern const size_t acl__tree_head_bytes;
 
 // A slot of either hash index: a key's hash in the upper half, the number
 // of what it finds (entry or tree slot) + 1 in the lower; 0 is free.  The

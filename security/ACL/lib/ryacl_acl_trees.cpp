@@ -119,9 +119,11 @@ bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, 
     }
     for (size_t k = 0; k < n; ++k)
         if (parts[k].tree_slot >= 0) {
+            // The header, and the first entry's mechanism behind it (at
+            // most acl__tree_head_bytes on, wherever the block starts).
             const char *t = reinterpret_cast<const char *>(trees->trees[parts[k].tree_slot]);
-            __builtin_prefetch(t);
-            __builtin_prefetch(t + 64);
+            for (size_t off = 0; off < acl__tree_head_bytes; off += 64) __builtin_prefetch(t + off);
+            __builtin_prefetch(t + acl__tree_head_bytes - 1);
         }
     for (size_t k = 0; k < n; ++k)
         if (parts[k].tree_slot >= 0) acl__tree_prefetch(trees->trees[parts[k].tree_slot], parts[k].idhash);
