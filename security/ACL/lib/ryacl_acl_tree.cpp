@@ -567,10 +567,13 @@ void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
     const big_part *b = t->big;
     if (b->idx) {
         __builtin_prefetch(&b->idx[slot_of(idhash, b->idx_mask)]);
-    } else {
-        // A small tree scans its entries: at most kScanMax of 16 bytes.
+    } else if (b->n <= kScanMax) {
+        // A small tree scans its entries.
         const char *e = reinterpret_cast<const char *>(b->ents);
         for (size_t off = 0; off < size_t{b->n} * sizeof(ent); off += 64) __builtin_prefetch(e + off);
+    } else if (b->n > 0) {
+        // An ordered one compares with its last entry only.
+        __builtin_prefetch(&b->ents[b->n - 1]);
     }
     __builtin_prefetch(b->ents + b->n, 1);
     __builtin_prefetch(b->arena + b->arena_len, 1);
