@@ -250,7 +250,10 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
     size_t slots = size_t{b->idx_mask} + 1;
     if (b->idx && need <= slots / 2) return true;
     size_t ns = b->idx ? slots : 8;
-    while (ns / 2 < need) ns *= 2;
+    // Quadrupling: every rebuild rehashes every identifier into pages that
+    // have never been touched, so fewer rebuilds cost less than the unused
+    // slots do.
+    while (ns / 2 < need) ns *= 4;
     if (ns > (size_t{1} << 31)) {
         *failed = SIZE_MAX;
         return false;
