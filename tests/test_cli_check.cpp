@@ -19,6 +19,7 @@ namespace {
 // Each directory under tests/golden is one run in a fresh directory and the C locale: args (one a
 // line); input, the file "acl" (absent: none), with its octal mode; stderr, exact but for @PROG@ and
 // @DIR@; status; cacl.hex, the bytes of acl.cacl (absent: nothing but the input may remain).
+using strings = std::vector<std::string>;
 const std::string kGolden = RYACL_SOURCE_DIR "/tests/golden/";
 const size_t npos = std::string::npos;
 
@@ -71,6 +72,27 @@ TEST(CliCheck, UserFileMustBeOwnedByTheUserAndWritableByNoOneElse) {
     EXPECT_TRUE(geteuid() != 0 || chmod(path.c_str(), 0644) != 0 || chown(path.c_str(), 65534, 65534) != 0 ||
                 rytest::run_ryaclfck({"-u", user, "-f", base}, "", {"LC_ALL=C"}).status == 36);  // someone else's
     unlink(path.c_str());
+}
+
+// A file that is there but cannot be opened (no read permission) is the
+// open's failure, with its errno: 156 for the checker, 124 for the library.
+TEST(CliCheck, AFileThatCannotBeOpenedReportsTheOpensErrno) {
+    rytest::tmp_dir d;
+    ASSERT_EQ(chmod(d.path().c_str(), 0755), 0);
+    rytest::write_file(d / "acl", "n r\n", 0);
+    // Root reads anything: run as nobody.
+    const strings as = geteuid() == 0 ? strings{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"}
+                                      : strings{};
+    auto run = [&](strings args) {
+        args.insert(args.begin(), as.begin(), as.end());
+        return rytest::run(args, "", {"LC_ALL=C"});
+    };
+    const auto fck = run({RYACLFCK_PATH, "-f", d / "acl"}), lib = run({RYACL_CMD_PATH, "query", "-n", d / "acl"});
+    const std::string errno_line = "returned by the open() subroutine: " + std::to_string(EACCES) + ".";
+    EXPECT_EQ(fck.status, ACL_RC_FILE_ERROR);
+    EXPECT_TRUE(fck.err.rfind("4471-170 ", 0) == 0 && fck.err.find(errno_line) != npos) << fck.err;
+    EXPECT_EQ(lib.status, 2);
+    EXPECT_TRUE(lib.err.rfind("4471-137 ", 0) == 0 && lib.err.find(errno_line) != npos) << lib.err;
 }
 
 // In process: a memory failure is never a fault of the file, so it ends
