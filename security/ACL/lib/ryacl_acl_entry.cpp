@@ -216,7 +216,41 @@ int32_t sec__create_acle(unsigned char type, uint32_t perm, const char *mech, co
     return create_acle(type, perm, mech, id, translate, acle);
 }
 
+namespace {
+
+// The default set's letters as one lookup each: every file entry's
+// permissions go through it.  0 marks a letter that is no template's (no
+// default template has code 0).  Built from the list itself, which never
+// changes, so the two cannot disagree.
+struct letter_table {
+    uint32_t code[256] = {};
+    letter_table() {
+        for (int32_t i = 13; i-- > 0;)  // the first template of a letter wins
+            code[static_cast<unsigned char>(acl__default_perm_list[i].printchar)] = acl__default_perm_list[i].code;
+    }
+};
+
+bool is_default_set(const sec_perm_set_desc *permset) {
+    return permset == &acl__default_perm_set && permset->perms == acl__default_perm_list && permset->count == 13;
+}
+
+}  // namespace
+
 int32_t sec__translate_perms(const char *ps, const sec_perm_set_desc *permset, uint32_t *perm) {
+    if (is_default_set(permset)) {
+        static const letter_table table;
+        uint32_t bits = 0;
+        for (const char *c = ps; *c; ++c) {
+            const uint32_t code = table.code[static_cast<unsigned char>(*c)];
+            if (!code) {
+                *perm |= bits;
+                return acl::set_error(ACL_RC_PERMISSION, acl::msg::BAD_PERM_LETTER, static_cast<unsigned char>(*c));
+            }
+            bits |= code;
+        }
+        *perm |= bits;
+        return ACL_RC_OK;
+    }
     const int32_t count = permset->count > 0 && permset->perms ? permset->count : 0;
     for (const char *c = ps; *c; ++c) {
         int32_t i = 0;

@@ -44,3 +44,21 @@ int32_t sec__translate_bitmask(uint32_t pbm, const sec_perm_set_desc *permset, c
 // blank or comment line), or a return code for a faulty line (consumed).
 int32_t sec__read_acle_from_text(const sec_perm_set_desc *permset, char **tacl, size_t *length,
                                  int32_t *lineno, sec_acle_t acle);
+
+// A faulty line's report, kept so that a caller that parses ahead can
+// record it when it reaches the line.  token points into the text.
+struct acl__line_fault {
+    int32_t rc = 0;
+    int32_t msg = 0;
+    int32_t line = 0;
+    const char *token = nullptr;
+    size_t length = 0;  // the line's bytes with its terminator
+};
+// sec__read_acle_from_text that records nothing: a faulty line's report
+// goes to *fault and its code is returned.  The thread's error may have
+// been changed on the way (a permission letter's message) and is not the
+// line's until acl__record_line_fault is called.
+int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
+                                sec_acle_t acle, acl__line_fault *fault);
+// Record the report as sec__read_acle_from_text does; returns its code.
+int32_t acl__record_line_fault(const acl__line_fault &fault);
