@@ -1,0 +1,97 @@
+// ryacl: an ACL file loaded as a list of entries, for the subcommands that
+// compare or explain ACLs rather than check them.  A text file is parsed
+// with the library's parser and screened for duplicates as a check would;
+// a compiled ACL (a cache file) is validated as the library validates one.
+// Entries keep their text line numbers, and an index finds an entry by type,
+// mechanism and identity without regard to letter case.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+#include <unordered_map>
+#include <vector>
+
+#include "ryacl.h"
+
+namespace ryacl {
+
+struct acl_item {
+    const char *id;     // NUL-terminated; null for types 1 and 2
+    uint32_t idlen;     // strlen(id), 0 when none
+    uint32_t perm;
+    uint32_t mech;      // index into loaded_acl::mechs (0: no mechanism)
+    int32_t line;       // line of a text file; 0 in a compiled ACL
+    unsigned char type;
+};
+
+// One sub-ACL: the entries of one type and mechanism, in the order that the
+// library's evaluation walks them.
+struct acl_sub {
+    unsigned char type;
+    uint32_t mech;
+    std::vector<uint32_t> items;
+};
+
+class loaded_acl {
+public:
+    loaded_acl() = default;
+    ~loaded_acl();
+    loaded_acl(const loaded_acl &) = delete;
+    loaded_acl &operator=(const loaded_acl &) = delete;
+
+    std::string path;
+    bool compiled = false;
+    std::vector<acl_item> items;       // text: file order; compiled: buffer order
+    std::vector<std::string> mechs;    // mechanism texts as first met; [0] is ""
+    std::vector<std::string> folded;   // the same, lower-cased (the matching key)
+
+    // Index of the entry of the same type, mechanism and identity (letter
+    // case ignored), or -1.  A compiled ACL that holds an entry twice
+    // answers with the first.
+    // `mech_here` is the slot of the key's mechanism in this ACL.
+    long find(const acl_item &key, const loaded_acl &keys_owner, uint32_t mech_here) const;
+    // Slot of a lower-cased mechanism in this ACL: 0 for none, -1 when absent.
+    long mech_slot(const std::string &folded_mech) const;
+    // Sub-ACLs in evaluation order: those of a compiled ACL in buffer order,
+    // those of a text in the order the library compiles them.
+    std::vector<acl_sub> subs() const;
+    // Whether items[i] is hidden by an earlier entry of the same key.
+    bool shadowed(size_t i) const { return i < shadow_.size() && shadow_[i]; }
+
+    // Filling (acl_load.cpp).
+    int32_t add_text(char *text, size_t size);
+    int32_t add_compiled(const unsigned char *p, size_t n);
+    char *bytes = nullptr;  // owned: the file read (text parsed in place)
+    size_t nbytes = 0;
+
+private:
+    uint32_t intern_mech(const char *m, size_t n);
+    long insert(uint32_t i);  // -1, or the index of the entry it duplicates
+    std::unordered_map<std::string, uint32_t> mech_slots_;  // folded text -> slot
+    std::vector<uint32_t> table_;  // open addressing; item index + 1, 0 empty
+    std::vector<bool> shadow_;
+    uint32_t last_mech_ = 0;
+};
+
+// Read the file at `path` as it is: a compiled ACL when it begins with the
+// compiled ACL's type and version bytes, text otherwise (`text_only`: always
+// text).  On failure the numbered message is on standard error and the
+// result is false.
+bool load_acl_file(const char *path, bool text_only, loaded_acl &out);
+// Load a compiled ACL in host byte order that the library has validated.
+bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded_acl &out);
+
+// An entry in ACL file syntax ("u unix alice rw"), without its letters
+// when `with_perm` is false; bytes from the file are passed as they stand.
+std::string entry_text(const loaded_acl &acl, const acl_item &e, bool with_perm = true);
+// Permission letters of a mask ("" for none); a bit without a template
+// shows the mask in hexadecimal instead.
+std::string perm_letters(uint32_t perm);
+// Word for a type in messages ("user", "group", ...).
+const char *type_word(unsigned char type);
+
+// Print the thread's current error (the report sequence) on stderr.
+void print_error();
+
+}  // namespace ryacl
