@@ -41,11 +41,11 @@ const char kHelp[] =
     "  -h, --help    show this help and exit\n"
     "\n"
     "The copy FILE.ryacl-XXXXXX (mode 0600, beside FILE) is opened with the\n"
-    "command in $VISUAL, else $EDITOR, else vi; the variable is run by\n"
-    "/bin/sh with the copy's name as its last argument, so it may hold\n"
-    "options and quoting.  While the editor runs, ryacl ignores SIGINT and\n"
-    "SIGQUIT (they are the editor's keys); SIGTERM and SIGHUP are passed on\n"
-    "to the editor and end the edit.\n"
+    "command in $VISUAL, else $EDITOR, else vi, run by /bin/sh as\n"
+    "'exec $VISUAL \"$@\"' with the copy's name as the argument, so the\n"
+    "variable may hold options and quoting.  While the editor runs, ryacl\n"
+    "ignores SIGINT and SIGQUIT (they are the editor's keys); SIGTERM and\n"
+    "SIGHUP are passed on to the editor and end the edit.\n"
     "\n"
     "When the editor returns: an unchanged copy changes nothing.  A changed\n"
     "one is checked as by 'ryacl check'; when it has faults they are shown\n"
@@ -235,7 +235,9 @@ int editor_session::edit_once() {
     const char *editor = std::getenv("VISUAL");
     if (!editor || !*editor) editor = std::getenv("EDITOR");
     if (!editor || !*editor) editor = "vi";
-    const std::string script = std::string(editor) + " \"$@\"";
+    // exec: the editor itself, not a shell above it, is the child that a
+    // signal is passed on to.
+    const std::string script = std::string("exec ") + editor + " \"$@\"";
 
     // The editor owns the terminal keys while it runs.
     struct sigaction ign {}, old_int {}, old_quit {};
