@@ -71,13 +71,13 @@ TEST_F(RyaclEdit, UnchangedAndCleanChanges) {
     expect_no_copy("clean");
 
     ::unlink((file + ".cacl").c_str());
-    const auto nc = edit(ed, "", {"--no-cache"});
+    const auto nc = edit(editor("add2", "printf 'g dev r\\n' >> \"$1\""), "", {"--no-cache"});
     EXPECT_EQ(nc.status, 0) << nc.err;
     EXPECT_FALSE(rytest::file_exists(file + ".cacl"));
     // EDITOR may hold arguments and quoting.
-    const auto args = edit("sed -i 's/alice rw/alice \"r\"/'");
+    const auto args = edit("sed -i 's/alice rw/alice   r/'");
     EXPECT_EQ(args.status, 0) << args.err;
-    EXPECT_NE(rytest::read_file(file).find("u unix alice \"r\""), std::string::npos);
+    EXPECT_NE(rytest::read_file(file).find("u unix alice   r\n"), std::string::npos);
 }
 
 TEST_F(RyaclEdit, FaultsAskWhatNowAndEachAnswerDoesWhatItSays) {

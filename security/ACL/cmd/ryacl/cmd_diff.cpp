@@ -12,6 +12,7 @@
 #include "acl_load.h"
 #include "ry_zo_int.h"
 #include "ryacl_cmd.h"
+#include "ryacl_cmd_util.h"
 
 namespace {
 
@@ -82,26 +83,6 @@ std::string letters_or_dash(uint32_t perm) {
     return s.empty() ? "-" : s;
 }
 
-void json_string(std::string &out, const char *p, size_t n) {
-    out += '"';
-    for (size_t i = 0; i < n; ++i) {
-        const unsigned char c = static_cast<unsigned char>(p[i]);
-        if (c == '"' || c == '\\') {
-            out += '\\';
-            out += static_cast<char>(c);
-        } else if (c < 0x20 || c == 0x7f) {
-            char u[8];
-            std::snprintf(u, sizeof u, "\\u%04x", c);
-            out += u;
-        } else {
-            out += static_cast<char>(c);
-        }
-    }
-    out += '"';
-}
-
-void json_string(std::string &out, const std::string &s) { json_string(out, s.data(), s.size()); }
-
 void print_text(const std::vector<difference> &diffs) {
     std::string buf;
     for (const difference &d : diffs) {
@@ -124,10 +105,8 @@ void print_text(const std::vector<difference> &diffs) {
 void print_json(const std::vector<difference> &diffs, const loaded_acl &o, const loaded_acl &n) {
     size_t count[3] = {0, 0, 0};
     for (const difference &d : diffs) ++count[static_cast<int>(d.kind)];
-    std::string out = "{\"version\": 1, \"old\": ";
-    json_string(out, o.path);
-    out += ", \"new\": ";
-    json_string(out, n.path);
+    using ryacl_util::json_string;
+    std::string out = "{\"version\": 1, \"old\": " + json_string(o.path) + ", \"new\": " + json_string(n.path);
     out += diffs.empty() ? ", \"same\": true" : ", \"same\": false";
     out += ", \"added\": " + std::to_string(count[0]) + ", \"removed\": " + std::to_string(count[1]) +
            ", \"changed\": " + std::to_string(count[2]) + ", \"differences\": [";
@@ -140,12 +119,10 @@ void print_json(const std::vector<difference> &diffs, const loaded_acl &o, const
         out += std::string("{\"change\": \"") + kinds[static_cast<int>(d.kind)] + "\", \"type\": \"" +
                ryacl::type_word(e.type) + '"';
         if (e.mech) {
-            out += ", \"mech\": ";
-            json_string(out, d.owner->mechs[e.mech]);
+            out += ", \"mech\": " + json_string(d.owner->mechs[e.mech]);
         }
         if (e.id) {
-            out += ", \"id\": ";
-            json_string(out, e.id, e.idlen);
+            out += ", \"id\": " + json_string(std::string_view(e.id, e.idlen));
         }
         if (d.old_e) out += ", \"old\": \"" + ryacl::perm_letters(d.old_e->perm) + '"';
         if (d.new_e) out += ", \"new\": \"" + ryacl::perm_letters(d.new_e->perm) + '"';
@@ -218,9 +195,5 @@ int ryacl_cmd_diff(int argc, char **argv) {
     const std::vector<difference> diffs = compare(o, n);
     if (json) print_json(diffs, o, n);
     else print_text(diffs);
-    if (std::fflush(stdout) != 0 || std::ferror(stdout)) {
-        std::fputs("ryacl diff: cannot write the differences\n", stderr);
-        return RYACL_EXIT_TROUBLE;
-    }
-    return diffs.empty() ? RYACL_EXIT_OK : RYACL_EXIT_FOUND;
+    return ryacl_util::finish(diffs.empty() ? RYACL_EXIT_OK : RYACL_EXIT_FOUND);
 }

@@ -15,6 +15,7 @@
 #include "ry_zo_int.h"
 #include "ryacl.h"
 #include "ryacl_cmd.h"
+#include "ryacl_cmd_util.h"
 #include "ryacl_error.h"
 
 namespace {
@@ -277,5 +278,5 @@ int ryacl_cmd_explain(int argc, char **argv) {
     if (text && !ryacl::load_acl_file(file, true, acl)) return RYACL_EXIT_TROUBLE;
     const int status = explain(acl, rq);
     std::printf("read from: %s (%s)\n", show(acl.path).c_str(), acl.compiled ? "cache file, current" : "text");
-    return status;
+    return ryacl_util::finish(status);
 }
