@@ -1,10 +1,7 @@
 // ryacl: loading a text or compiled ACL file into entries (see acl_load.h).
-//
-// Duplicates are found by the command's own index, which diff needs anyway,
-// rather than by building the library's trees as well: one pass of hashing
-// instead of two.  When the index finds one, the two entries are handed to
-// a fresh set of trees, so the message printed is exactly the library's.
 #include "acl_load.h"
+
+#include "acl_match.h"
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -25,50 +22,6 @@
 #include "ryacl_error.h"
 
 namespace ryacl {
-
-namespace {
-
-uint64_t mix(uint64_t h) {
-    h ^= h >> 33;
-    h *= 0xff51afd7ed558ccdull;
-    h ^= h >> 33;
-    return h;
-}
-
-// Hash of the matching key: type, mechanism slot and folded identifier.
-uint64_t key_hash(const acl_item &e, uint32_t mech) {
-    uint64_t h = (uint64_t{e.type} << 32) ^ mech ^ 0x9e3779b97f4a7c15ull;
-    for (uint32_t i = 0; i < e.idlen; ++i) h = (h ^ zo::fold(static_cast<unsigned char>(e.id[i]))) * 0x100000001b3ull;
-    return mix(h);
-}
-
-bool same_key(const acl_item &a, const loaded_acl &aa, const acl_item &b, const loaded_acl &ba) {
-    if (a.type != b.type || a.idlen != b.idlen) return false;
-    if (a.mech != b.mech && aa.folded[a.mech] != ba.folded[b.mech]) return false;
-    return a.idlen == 0 || zo::casecmp_len(a.id, a.idlen, b.id, b.idlen) == 0;
-}
-
-// The library's own message for two entries found equal: add both to a
-// fresh set of trees.
-int32_t report_duplicate(const loaded_acl &acl, const acl_item &first, const acl_item &dup) {
-    acl__trees_s trees;
-    int32_t rc = 0;
-    for (const acl_item *e : {&first, &dup}) {
-        sec_acle_desc d{};
-        d.perm = e->perm;
-        d.type = e->type;
-        std::memcpy(d.mech, acl.mechs[e->mech].c_str(), std::min<size_t>(acl.mechs[e->mech].size(), 16));
-        d.id = const_cast<char *>(e->id);
-        if ((rc = sec__add_acle_to_trees(&d, &trees)) != 0) break;
-    }
-    acl__free_trees(&trees);
-    // Equal to the index but not to the trees cannot happen; should it, the
-    // file is still refused rather than compared wrongly.
-    return rc ? rc : acl::set_error(ACL_RC_BAD_ACLE, 144, acl__type_letter(dup.type), acl.mechs[dup.mech].c_str(),
-                                    dup.id ? dup.id : "");
-}
-
-}  // namespace
 
 loaded_acl::~loaded_acl() { std::free(bytes); }
 
@@ -91,40 +44,6 @@ uint32_t loaded_acl::intern_mech(const char *m, size_t n) {
     return last_mech_ = static_cast<uint32_t>(mechs.size() - 1);
 }
 
-long loaded_acl::insert(uint32_t i) {
-    if ((items.size() + 1) * 2 > table_.size()) {
-        std::vector<uint32_t> old(std::max<size_t>(1024, table_.size() * 2), 0);
-        old.swap(table_);
-        const size_t mask = table_.size() - 1;
-        for (uint32_t v : old) {
-            if (!v) continue;
-            size_t s = key_hash(items[v - 1], items[v - 1].mech) & mask;
-            while (table_[s]) s = (s + 1) & mask;
-            table_[s] = v;
-        }
-    }
-    const size_t mask = table_.size() - 1;
-    size_t s = key_hash(items[i], items[i].mech) & mask;
-    for (; table_[s]; s = (s + 1) & mask)
-        if (same_key(items[table_[s] - 1], *this, items[i], *this)) return table_[s] - 1;
-    table_[s] = i + 1;
-    return -1;
-}
-
-long loaded_acl::mech_slot(const std::string &folded_mech) const {
-    if (folded_mech.empty()) return 0;
-    auto it = mech_slots_.find(folded_mech);
-    return it == mech_slots_.end() ? -1 : static_cast<long>(it->second);
-}
-
-long loaded_acl::find(const acl_item &key, const loaded_acl &keys_owner, uint32_t mech_here) const {
-    if (table_.empty()) return -1;
-    const size_t mask = table_.size() - 1;
-    for (size_t s = key_hash(key, mech_here) & mask; table_[s]; s = (s + 1) & mask)
-        if (same_key(items[table_[s] - 1], *this, key, keys_owner)) return table_[s] - 1;
-    return -1;
-}
-
 int32_t loaded_acl::add_text(char *text, size_t size) {
     char *cursor = text;
     size_t left = size + 1;  // the terminating NUL counts
@@ -144,8 +63,6 @@ int32_t loaded_acl::add_text(char *text, size_t size) {
         e.id = acle.id;
         e.idlen = acle.id ? static_cast<uint32_t>(std::strlen(acle.id)) : 0;
         items.push_back(e);
-        long dup = insert(static_cast<uint32_t>(items.size() - 1));
-        if (dup >= 0) return report_duplicate(*this, items[static_cast<size_t>(dup)], e);
     }
 }
 
@@ -173,11 +90,6 @@ int32_t loaded_acl::add_compiled(const unsigned char *p, size_t n) {
                 e.idlen = static_cast<uint32_t>(idlen - 1);
             }
             items.push_back(e);
-            const long dup = insert(static_cast<uint32_t>(items.size() - 1));
-            // A compiled ACL from elsewhere may hold a key twice; evaluation
-            // finds the first, so the later one counts for nothing.
-            shadow_.resize(items.size());
-            shadow_.back() = dup >= 0;
             at += ACL_ENTRY_HDR_SIZE + idlen;
         }
         pos += sublen;
@@ -218,46 +130,39 @@ std::vector<acl_sub> loaded_acl::subs() const {
 
 namespace {
 
-// Open and read a file whole, with the library's reader and messages.
-bool read_file(const char *path, char **bytes, size_t *size) {
+// Read and parse or walk; a failure is recorded, and the entries read
+// before it stay.
+int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
+    out.path = path;
+    out.mechs.assign(1, "");
+    out.folded.assign(1, "");
     int fd = open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-    if (fd < 0) {
-        acl::set_error(ACL_RC_FILE_ERROR, 124, path, errno);
-        print_error();
-        return false;
-    }
-    int32_t rc = acl__read_acl_file(path, fd, bytes, size);
+    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, path, errno);
+    int32_t rc = acl__read_acl_file(path, fd, &out.bytes, &out.nbytes);
     close(fd);
-    if (rc) print_error();
-    return rc == 0;
+    if (rc || !out.bytes) return rc;  // an empty file: no entries
+    const auto *p = reinterpret_cast<const unsigned char *>(out.bytes);
+    if (text_only || out.nbytes < 2 || p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION)
+        return out.add_text(out.bytes, out.nbytes);
+    // Only a compiled ACL in this host's byte order is compared: one in the
+    // other order was not written here and is refused, not guessed at.
+    if (out.nbytes > INT32_MAX) return acl::set_error(ACL_RC_BAD_ACL, 106, 0, ACL_LOC_ACL);
+    if (out.nbytes < ACL_HDR_SIZE)
+        return acl::set_error(ACL_RC_BAD_ACL, 106, static_cast<int32_t>(out.nbytes), ACL_LOC_ACL);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+    sec_buffer_desc d{static_cast<int32_t>(out.nbytes), out.bytes};
+    if ((rc = sec__check_acl_buffer(&d)) != 0) return rc;
+    return out.add_compiled(p, out.nbytes);
 }
 
 }  // namespace
 
-bool load_acl_file(const char *path, bool text_only, loaded_acl &out) {
-    out.path = path;
-    out.mechs.assign(1, "");
-    out.folded.assign(1, "");
-    if (!read_file(path, &out.bytes, &out.nbytes)) return false;
-    if (!out.bytes) return true;  // an empty file: no entries
-    const auto *p = reinterpret_cast<const unsigned char *>(out.bytes);
-    int32_t rc;
-    if (!text_only && out.nbytes >= 2 && p[0] == ACL_BUF_TYPE && p[1] == ACL_BUF_VERSION) {
-        // Only a compiled ACL in this host's byte order is compared: one in
-        // the other order was not written here and is refused, not guessed at.
-        if (out.nbytes > INT32_MAX) {
-            rc = acl::set_error(ACL_RC_BAD_ACL, 106, 0, ACL_LOC_ACL);
-        } else if (out.nbytes < ACL_HDR_SIZE) {
-            rc = acl::set_error(ACL_RC_BAD_ACL, 106, static_cast<int32_t>(out.nbytes), ACL_LOC_ACL);
-        } else if (p[2] != ACL_BUF_HOST_ORDER) {
-            rc = acl::set_error(ACL_RC_BAD_ACL, 102);
-        } else {
-            sec_buffer_desc d{static_cast<int32_t>(out.nbytes), out.bytes};
-            rc = sec__check_acl_buffer(&d);
-            if (!rc) rc = out.add_compiled(p, out.nbytes);
-        }
-    } else {
-        rc = out.add_text(out.bytes, out.nbytes);
+bool load_acl_file(const char *path, bool text_only, loaded_acl &out, bool screen) {
+    int32_t rc = read_acl_file(path, text_only, out);
+    if (rc || screen) {
+        const loaded_acl none;
+        entry_matcher alone(out, none);
+        if (int32_t dup = alone.run()) rc = dup;
     }
     if (rc) print_error();
     return rc == 0;

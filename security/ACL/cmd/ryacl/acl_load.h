@@ -2,8 +2,8 @@
 // compare or explain ACLs rather than check them.  A text file is parsed
 // with the library's parser and screened for duplicates as a check would;
 // a compiled ACL (a cache file) is validated as the library validates one.
-// Entries keep their text line numbers, and an index finds an entry by type,
-// mechanism and identity without regard to letter case.
+// Entries keep their text line numbers.  Duplicates are the business of
+// acl_match.h, which diff needs anyway.
 #pragma once
 
 #include <cstddef>
@@ -46,18 +46,9 @@ public:
     std::vector<std::string> mechs;    // mechanism texts as first met; [0] is ""
     std::vector<std::string> folded;   // the same, lower-cased (the matching key)
 
-    // Index of the entry of the same type, mechanism and identity (letter
-    // case ignored), or -1.  A compiled ACL that holds an entry twice
-    // answers with the first.
-    // `mech_here` is the slot of the key's mechanism in this ACL.
-    long find(const acl_item &key, const loaded_acl &keys_owner, uint32_t mech_here) const;
-    // Slot of a lower-cased mechanism in this ACL: 0 for none, -1 when absent.
-    long mech_slot(const std::string &folded_mech) const;
     // Sub-ACLs in evaluation order: those of a compiled ACL in buffer order,
     // those of a text in the order the library compiles them.
     std::vector<acl_sub> subs() const;
-    // Whether items[i] is hidden by an earlier entry of the same key.
-    bool shadowed(size_t i) const { return i < shadow_.size() && shadow_[i]; }
 
     // Filling (acl_load.cpp).
     int32_t add_text(char *text, size_t size);
@@ -67,18 +58,17 @@ public:
 
 private:
     uint32_t intern_mech(const char *m, size_t n);
-    long insert(uint32_t i);  // -1, or the index of the entry it duplicates
     std::unordered_map<std::string, uint32_t> mech_slots_;  // folded text -> slot
-    std::vector<uint32_t> table_;  // open addressing; item index + 1, 0 empty
-    std::vector<bool> shadow_;
     uint32_t last_mech_ = 0;
 };
 
 // Read the file at `path` as it is: a compiled ACL when it begins with the
 // compiled ACL's type and version bytes, text otherwise (`text_only`: always
-// text).  On failure the numbered message is on standard error and the
-// result is false.
-bool load_acl_file(const char *path, bool text_only, loaded_acl &out);
+// text), and screen it for duplicates (without `screen`, only when it is
+// faulty otherwise: a duplicate before the faulty line is its first fault).
+// On failure the numbered message is on standard error and the result is
+// false.
+bool load_acl_file(const char *path, bool text_only, loaded_acl &out, bool screen = true);
 // Load a compiled ACL in host byte order that the library has validated.
 bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded_acl &out);
 

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "acl_load.h"
+#include "acl_match.h"
 #include "ry_zo_int.h"
 #include "ryacl_cmd.h"
 #include "ryacl_cmd_util.h"
@@ -136,28 +137,21 @@ void print_json(const std::vector<difference> &diffs, const loaded_acl &o, const
     std::fwrite(out.data(), 1, out.size(), stdout);
 }
 
-std::vector<difference> compare(const loaded_acl &o, const loaded_acl &n) {
-    std::vector<difference> diffs;
-    // Each NEW mechanism's slot in OLD, looked up once.
-    std::vector<long> slot(n.folded.size());
-    for (size_t m = 0; m < n.folded.size(); ++m) slot[m] = o.mech_slot(n.folded[m]);
-    std::vector<bool> matched(o.items.size(), false);
-    for (size_t i = 0; i < n.items.size(); ++i) {
-        if (n.shadowed(i)) continue;
-        const acl_item &e = n.items[i];
-        const long at = slot[e.mech] < 0 ? -1 : o.find(e, n, static_cast<uint32_t>(slot[e.mech]));
-        if (at < 0) {
-            diffs.push_back({change::added, nullptr, &e, &n});
-            continue;
-        }
-        matched[static_cast<size_t>(at)] = true;
-        const acl_item &was = o.items[static_cast<size_t>(at)];
-        if (was.perm != e.perm) diffs.push_back({change::changed, &was, &e, &n});
+// 0 and the differences, or the return code of a refusal (recorded).
+int32_t compare(const loaded_acl &o, const loaded_acl &n, std::vector<difference> &diffs) {
+    ryacl::entry_matcher m(o, n);
+    if (int32_t rc = m.run()) return rc;
+    for (size_t i = 0; i < o.items.size(); ++i) {
+        const uint32_t j = m.old_match[i];
+        if (j == ryacl::entry_matcher::kShadowed) continue;
+        if (j == ryacl::entry_matcher::kNone) diffs.push_back({change::removed, &o.items[i], nullptr, &o});
+        else if (o.items[i].perm != n.items[j - 1].perm)
+            diffs.push_back({change::changed, &o.items[i], &n.items[j - 1], &n});
     }
-    for (size_t i = 0; i < o.items.size(); ++i)
-        if (!matched[i] && !o.shadowed(i)) diffs.push_back({change::removed, &o.items[i], nullptr, &o});
+    for (size_t j = 0; j < n.items.size(); ++j)
+        if (!m.new_done[j]) diffs.push_back({change::added, nullptr, &n.items[j], &n});
     std::sort(diffs.begin(), diffs.end(), before);
-    return diffs;
+    return 0;
 }
 
 }  // namespace
@@ -190,9 +184,14 @@ int ryacl_cmd_diff(int argc, char **argv) {
         return RYACL_EXIT_TROUBLE;
     }
     loaded_acl o, n;
-    if (!ryacl::load_acl_file(argv[optind], false, o) || !ryacl::load_acl_file(argv[optind + 1], false, n))
+    // The matching screens both files for duplicates in the same pass.
+    if (!ryacl::load_acl_file(argv[optind], false, o, false) || !ryacl::load_acl_file(argv[optind + 1], false, n, false))
         return RYACL_EXIT_TROUBLE;
-    const std::vector<difference> diffs = compare(o, n);
+    std::vector<difference> diffs;
+    if (compare(o, n, diffs) != 0) {
+        ryacl::print_error();
+        return RYACL_EXIT_TROUBLE;
+    }
     if (json) print_json(diffs, o, n);
     else print_text(diffs);
     return ryacl_util::finish(diffs.empty() ? RYACL_EXIT_OK : RYACL_EXIT_FOUND);
