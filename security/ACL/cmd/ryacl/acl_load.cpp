@@ -12,6 +12,8 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <map>
+#include <new>
 
 #include "ry_zo_int.h"
 #include "ryacl_acl_buffer.h"
@@ -20,6 +22,7 @@
 #include "ryacl_acl_file.h"
 #include "ryacl_acl_tree.h"
 #include "ryacl_error.h"
+#include "ryacl_cmd.h"
 
 namespace ryacl {
 
@@ -27,21 +30,13 @@ loaded_acl::~loaded_acl() { std::free(bytes); }
 
 void print_error() { acl::report_current_error(stderr, true); }
 
-uint32_t loaded_acl::intern_mech(const char *m, size_t n) {
-    if (mechs.empty()) {
-        mechs.emplace_back();
-        folded.emplace_back();
+int out_of_memory_guard(const char *subcommand, const std::function<int()> &run) {
+    try {
+        return run();
+    } catch (const std::bad_alloc &) {
+        std::fprintf(stderr, "ryacl %s: out of memory\n", subcommand);
+        return RYACL_EXIT_TROUBLE;
     }
-    if (n == 0) return 0;
-    std::string f(m, n);
-    for (char &c : f) c = static_cast<char>(zo::fold(static_cast<unsigned char>(c)));
-    // Files mostly repeat one mechanism line after line.
-    if (last_mech_ && folded[last_mech_] == f) return last_mech_;
-    auto [it, fresh] = mech_slots_.try_emplace(f, static_cast<uint32_t>(mechs.size()));
-    if (!fresh) return last_mech_ = it->second;
-    mechs.emplace_back(m, n);
-    folded.push_back(std::move(f));
-    return last_mech_ = static_cast<uint32_t>(mechs.size() - 1);
 }
 
 int32_t loaded_acl::add_text(char *text, size_t size) {
@@ -59,7 +54,8 @@ int32_t loaded_acl::add_text(char *text, size_t size) {
         e.type = acle.type;
         e.perm = acle.perm;
         e.line = line;
-        e.mech = intern_mech(acle.mech, strnlen(acle.mech, 16));
+        std::memcpy(e.mech, acle.mech, sizeof e.mech);
+        e.mech[16] = '\0';
         e.id = acle.id;
         e.idlen = acle.id ? static_cast<uint32_t>(std::strlen(acle.id)) : 0;
         items.push_back(e);
@@ -77,18 +73,21 @@ int32_t loaded_acl::add_compiled(const unsigned char *p, size_t n) {
         const unsigned char type = p[pos + 4];
         const uint32_t count = acl__load_le32(p + pos + 5);
         const size_t mlen = p[pos + 9];
-        const uint32_t mech = intern_mech(reinterpret_cast<const char *>(p + pos + 10), mlen ? mlen - 1 : 0);
+        // Validated: a mechanism ends on its zero byte within 17 bytes.
+        const char *mech = mlen ? reinterpret_cast<const char *>(p + pos + 10) : "";
+        acl_sub &sub = compiled_subs_.emplace_back(acl_sub{type, mech, {}});
         size_t at = pos + ACL_SUBACL_HDR_SIZE + mlen;
         for (uint32_t j = 0; j < count && at + ACL_ENTRY_HDR_SIZE <= n; ++j) {
             const size_t idlen = acl__load_le16(p + at + 5);
             acl_item e{};
             e.type = type;
             e.perm = acl__load_le32(p + at + 1);
-            e.mech = mech;
+            std::memcpy(e.mech, mech, std::strlen(mech) + 1);
             if (idlen) {
                 e.id = reinterpret_cast<const char *>(p + at + ACL_ENTRY_HDR_SIZE);
                 e.idlen = static_cast<uint32_t>(idlen - 1);
             }
+            sub.items.push_back(static_cast<uint32_t>(items.size()));
             items.push_back(e);
             at += ACL_ENTRY_HDR_SIZE + idlen;
         }
@@ -98,32 +97,23 @@ int32_t loaded_acl::add_compiled(const unsigned char *p, size_t n) {
 }
 
 std::vector<acl_sub> loaded_acl::subs() const {
+    if (compiled) return compiled_subs_;
+    // A text's entries of one sub-ACL may be spread over the file.
     std::vector<acl_sub> out;
+    std::map<std::pair<unsigned char, std::string>, size_t> at;
     for (uint32_t i = 0; i < items.size(); ++i) {
         const acl_item &e = items[i];
-        // A compiled ACL's sub-ACLs are contiguous runs; a text's entries of
-        // one sub-ACL may be spread over the file.
-        acl_sub *s = nullptr;
-        if (compiled) {
-            if (!out.empty() && out.back().type == e.type && out.back().mech == e.mech &&
-                (out.back().items.empty() || i == out.back().items.back() + 1))
-                s = &out.back();
-        } else {
-            for (acl_sub &c : out)
-                if (c.type == e.type && c.mech == e.mech) s = &c;
-        }
-        if (!s) s = &out.emplace_back(acl_sub{e.type, e.mech, {}});
-        s->items.push_back(i);
+        auto [it, fresh] = at.try_emplace({e.type, e.mech}, out.size());
+        if (fresh) out.push_back(acl_sub{e.type, e.mech, {}});
+        out[it->second].items.push_back(i);
     }
-    if (!compiled) {
-        // The library lays user and group entries down in ascending
-        // case-insensitive order, expanded entries as they came.
-        for (acl_sub &s : out) {
-            if (s.type != SEC_ACLE_TYPE_USER && s.type != SEC_ACLE_TYPE_GROUP) continue;
-            std::stable_sort(s.items.begin(), s.items.end(), [this](uint32_t a, uint32_t b) {
-                return zo::casecmp_len(items[a].id, items[a].idlen, items[b].id, items[b].idlen) < 0;
-            });
-        }
+    // The library lays user and group entries down in ascending
+    // case-insensitive order, expanded entries as they came.
+    for (acl_sub &s : out) {
+        if (s.type != SEC_ACLE_TYPE_USER && s.type != SEC_ACLE_TYPE_GROUP) continue;
+        std::stable_sort(s.items.begin(), s.items.end(), [this](uint32_t a, uint32_t b) {
+            return zo::casecmp_len(items[a].id, items[a].idlen, items[b].id, items[b].idlen) < 0;
+        });
     }
     return out;
 }
@@ -134,8 +124,6 @@ namespace {
 // before it stay.
 int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
     out.path = path;
-    out.mechs.assign(1, "");
-    out.folded.assign(1, "");
     int fd = open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
     if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, path, errno);
     int32_t rc = acl__read_acl_file(path, fd, &out.bytes, &out.nbytes);
@@ -170,8 +158,6 @@ bool load_acl_file(const char *path, bool text_only, loaded_acl &out, bool scree
 
 bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded_acl &out) {
     out.path = path;
-    out.mechs.assign(1, "");
-    out.folded.assign(1, "");
     const size_t n = static_cast<size_t>(buf.length);
     out.bytes = static_cast<char *>(std::malloc(n ? n : 1));
     if (!out.bytes) {
@@ -193,9 +179,9 @@ std::string perm_letters(uint32_t perm) {
     return hex;
 }
 
-std::string entry_text(const loaded_acl &acl, const acl_item &e, bool with_perm) {
+std::string entry_text(const acl_item &e, bool with_perm) {
     std::string s(1, acl__type_letter(e.type));
-    if (e.mech) s += ' ' + acl.mechs[e.mech];
+    if (e.mech[0]) s.append(" ").append(e.mech);
     if (e.id) s.append(" ").append(e.id, e.idlen);
     if (with_perm && e.perm) s += ' ' + perm_letters(e.perm);
     return s;

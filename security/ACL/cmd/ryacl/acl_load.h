@@ -8,8 +8,8 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <string>
-#include <unordered_map>
 #include <vector>
 
 #include "ryacl.h"
@@ -20,7 +20,7 @@ struct acl_item {
     const char *id;     // NUL-terminated; null for types 1 and 2
     uint32_t idlen;     // strlen(id), 0 when none
     uint32_t perm;
-    uint32_t mech;      // index into loaded_acl::mechs (0: no mechanism)
+    char mech[17];      // "" for types without; lower-case from a text
     int32_t line;       // line of a text file; 0 in a compiled ACL
     unsigned char type;
 };
@@ -29,7 +29,7 @@ struct acl_item {
 // library's evaluation walks them.
 struct acl_sub {
     unsigned char type;
-    uint32_t mech;
+    const char *mech;  // that of its first entry
     std::vector<uint32_t> items;
 };
 
@@ -43,9 +43,6 @@ public:
     std::string path;
     bool compiled = false;
     std::vector<acl_item> items;       // text: file order; compiled: buffer order
-    std::vector<std::string> mechs;    // mechanism texts as first met; [0] is ""
-    std::vector<std::string> folded;   // the same, lower-cased (the matching key)
-
     // Sub-ACLs in evaluation order: those of a compiled ACL in buffer order,
     // those of a text in the order the library compiles them.
     std::vector<acl_sub> subs() const;
@@ -57,9 +54,7 @@ public:
     size_t nbytes = 0;
 
 private:
-    uint32_t intern_mech(const char *m, size_t n);
-    std::unordered_map<std::string, uint32_t> mech_slots_;  // folded text -> slot
-    uint32_t last_mech_ = 0;
+    std::vector<acl_sub> compiled_subs_;  // as the buffer lays them down
 };
 
 // Read the file at `path` as it is: a compiled ACL when it begins with the
@@ -74,7 +69,7 @@ bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded
 
 // An entry in ACL file syntax ("u unix alice rw"), without its letters
 // when `with_perm` is false; bytes from the file are passed as they stand.
-std::string entry_text(const loaded_acl &acl, const acl_item &e, bool with_perm = true);
+std::string entry_text(const acl_item &e, bool with_perm = true);
 // Permission letters of a mask ("" for none); a bit without a template
 // shows the mask in hexadecimal instead.
 std::string perm_letters(uint32_t perm);
@@ -83,5 +78,9 @@ const char *type_word(unsigned char type);
 
 // Print the thread's current error (the report sequence) on stderr.
 void print_error();
+
+// Run a subcommand; memory that cannot be had ends it with a message and
+// the trouble status instead of an abort, its objects released on the way.
+int out_of_memory_guard(const char *subcommand, const std::function<int()> &run);
 
 }  // namespace ryacl

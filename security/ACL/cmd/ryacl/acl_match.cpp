@@ -10,7 +10,6 @@
 #include <algorithm>
 #include <cstring>
 #include <string>
-#include <unordered_map>
 
 #include "ry_zo_int.h"
 #include "ryacl_acl_entry.h"
@@ -30,6 +29,9 @@ uint64_t mix(uint64_t h) {
     return h;
 }
 
+// Eight bytes of a mechanism field (zero-padded to 17), folded.
+uint64_t mech_word(const char *mech, size_t at) { return zo::fold8(zo::load8(mech + at)); }
+
 // Folded identifier, eight bytes at a time; never reads past its end.
 uint64_t id_hash(const char *id, size_t n, uint64_t h) {
     size_t i = 0;
@@ -45,15 +47,14 @@ constexpr size_t kSlotAhead = 24, kEntryAhead = 12, kIdAhead = 6;
 
 // The library's own message for two entries found equal: add both to a
 // fresh set of trees.
-int32_t report_duplicate(const loaded_acl &acl, const acl_item &first, const acl_item &dup) {
+int32_t report_duplicate(const acl_item &first, const acl_item &dup) {
     acl__trees_s trees;
     int32_t rc = 0;
     for (const acl_item *e : {&first, &dup}) {
         sec_acle_desc d{};
         d.perm = e->perm;
         d.type = e->type;
-        const std::string &m = acl.mechs[e->mech];
-        std::memcpy(d.mech, m.c_str(), std::min<size_t>(m.size(), 16));
+        std::memcpy(d.mech, e->mech, sizeof d.mech);
         d.id = const_cast<char *>(e->id);
         if ((rc = sec__add_acle_to_trees(&d, &trees)) != 0) break;
     }
@@ -61,21 +62,13 @@ int32_t report_duplicate(const loaded_acl &acl, const acl_item &first, const acl
     // Equal here but not to the trees cannot happen; should it, the file
     // is still refused rather than compared wrongly.
     return rc ? rc
-              : acl::set_error(ACL_RC_BAD_ACLE, 144, acl__type_letter(dup.type), acl.mechs[dup.mech].c_str(),
+              : acl::set_error(ACL_RC_BAD_ACLE, 144, acl__type_letter(dup.type), dup.mech,
                                dup.id ? dup.id : "");
 }
 
 }  // namespace
 
 entry_matcher::entry_matcher(const loaded_acl &o, const loaded_acl &n) : acl_{&o, &n} {
-    // Mechanisms compare by number: equal folded texts get one number.
-    std::unordered_map<std::string, uint32_t> numbers;
-    for (int s = 0; s < 2; ++s) {
-        const auto &folded = acl_[s]->folded;
-        mech_key_[s].resize(folded.size());
-        for (size_t m = 0; m < folded.size(); ++m)
-            mech_key_[s][m] = numbers.try_emplace(folded[m], static_cast<uint32_t>(numbers.size())).first->second;
-    }
     size_t cap = 1024;
     while (cap < 2 * (o.items.size() + n.items.size())) cap *= 2;
     table_.assign(cap, 0);
@@ -95,7 +88,8 @@ const acl_item *entry_matcher::first_candidate(uint64_t h) const {
 
 bool entry_matcher::same(int sa, uint32_t a, int sb, uint32_t b) const {
     const acl_item &x = acl_[sa]->items[a], &y = acl_[sb]->items[b];
-    return x.type == y.type && x.idlen == y.idlen && mech_key_[sa][x.mech] == mech_key_[sb][y.mech] &&
+    return x.type == y.type && x.idlen == y.idlen && mech_word(x.mech, 0) == mech_word(y.mech, 0) &&
+           mech_word(x.mech, 8) == mech_word(y.mech, 8) &&
            (x.idlen == 0 || zo::casecmp_len(x.id, x.idlen, y.id, y.idlen) == 0);
 }
 
@@ -105,7 +99,7 @@ int32_t entry_matcher::add_side(int side) {
     std::vector<uint64_t> hashes(n);
     for (size_t i = 0; i < n; ++i) {
         const acl_item &e = acl.items[i];
-        const uint64_t seed = (uint64_t{mech_key_[side][e.mech]} << 8 | e.type) * kMul;
+        const uint64_t seed = mix((mech_word(e.mech, 0) ^ e.type) * kMul ^ mech_word(e.mech, 8));
         hashes[i] = id_hash(e.id, e.idlen, seed);
     }
     for (size_t i = 0; i < n; ++i) {
@@ -135,7 +129,7 @@ int32_t entry_matcher::add_side(int side) {
                 // The key is already on this side.
                 if (!acl.compiled) {
                     const acl_item &first = rs == side ? acl.items[ri] : acl.items[old_match[ri] - 1];
-                    return report_duplicate(acl, first, acl.items[me]);
+                    return report_duplicate(first, acl.items[me]);
                 }
                 if (side == 0) old_match[me] = kShadowed;
                 else new_done[me] = true;

@@ -61,7 +61,6 @@ struct difference {
     change kind;
     const acl_item *old_e;  // null when added
     const acl_item *new_e;  // null when removed
-    const loaded_acl *owner;  // the ACL whose spelling is shown
     const acl_item &shown() const { return new_e ? *new_e : *old_e; }
 };
 
@@ -70,8 +69,7 @@ int type_rank(unsigned char t) { return t; }  // n 1, o 2, u 4, e 8, g 16
 bool before(const difference &a, const difference &b) {
     const acl_item &x = a.shown(), &y = b.shown();
     if (x.type != y.type) return type_rank(x.type) < type_rank(y.type);
-    const std::string &mx = a.owner->folded[x.mech], &my = b.owner->folded[y.mech];
-    if (int c = mx.compare(my)) return c < 0;
+    if (int c = zo_strcasecmp_posix_1(x.mech, y.mech)) return c < 0;
     if (x.idlen || y.idlen) {
         if (int c = zo::casecmp_len(x.id ? x.id : "", x.idlen, y.id ? y.id : "", y.idlen)) return c < 0;
         if (int c = std::memcmp(x.id, y.id, std::min(x.idlen, y.idlen))) return c < 0;
@@ -89,10 +87,10 @@ void print_text(const std::vector<difference> &diffs) {
     for (const difference &d : diffs) {
         const acl_item &e = d.shown();
         switch (d.kind) {
-        case change::added: buf += "+ " + ryacl::entry_text(*d.owner, e); break;
-        case change::removed: buf += "- " + ryacl::entry_text(*d.owner, e); break;
+        case change::added: buf += "+ " + ryacl::entry_text(e); break;
+        case change::removed: buf += "- " + ryacl::entry_text(e); break;
         case change::changed:
-            buf += "~ " + ryacl::entry_text(*d.owner, e, false) + ' ' + letters_or_dash(d.old_e->perm) + " -> " +
+            buf += "~ " + ryacl::entry_text(e, false) + ' ' + letters_or_dash(d.old_e->perm) + " -> " +
                    letters_or_dash(d.new_e->perm);
             break;
         }
@@ -119,8 +117,8 @@ void print_json(const std::vector<difference> &diffs, const loaded_acl &o, const
         first = false;
         out += std::string("{\"change\": \"") + kinds[static_cast<int>(d.kind)] + "\", \"type\": \"" +
                ryacl::type_word(e.type) + '"';
-        if (e.mech) {
-            out += ", \"mech\": " + json_string(d.owner->mechs[e.mech]);
+        if (e.mech[0]) {
+            out += ", \"mech\": " + json_string(e.mech);
         }
         if (e.id) {
             out += ", \"id\": " + json_string(std::string_view(e.id, e.idlen));
@@ -144,19 +142,17 @@ int32_t compare(const loaded_acl &o, const loaded_acl &n, std::vector<difference
     for (size_t i = 0; i < o.items.size(); ++i) {
         const uint32_t j = m.old_match[i];
         if (j == ryacl::entry_matcher::kShadowed) continue;
-        if (j == ryacl::entry_matcher::kNone) diffs.push_back({change::removed, &o.items[i], nullptr, &o});
+        if (j == ryacl::entry_matcher::kNone) diffs.push_back({change::removed, &o.items[i], nullptr});
         else if (o.items[i].perm != n.items[j - 1].perm)
-            diffs.push_back({change::changed, &o.items[i], &n.items[j - 1], &n});
+            diffs.push_back({change::changed, &o.items[i], &n.items[j - 1]});
     }
     for (size_t j = 0; j < n.items.size(); ++j)
-        if (!m.new_done[j]) diffs.push_back({change::added, nullptr, &n.items[j], &n});
+        if (!m.new_done[j]) diffs.push_back({change::added, nullptr, &n.items[j]});
     std::sort(diffs.begin(), diffs.end(), before);
     return 0;
 }
 
-}  // namespace
-
-int ryacl_cmd_diff(int argc, char **argv) {
+int run_diff(int argc, char **argv) {
     static const option longopts[] = {
         {"format", required_argument, nullptr, 'f'}, {"help", no_argument, nullptr, 'h'}, {nullptr, 0, nullptr, 0}};
     bool json = false;
@@ -195,4 +191,10 @@ int ryacl_cmd_diff(int argc, char **argv) {
     if (json) print_json(diffs, o, n);
     else print_text(diffs);
     return ryacl_util::finish(diffs.empty() ? RYACL_EXIT_OK : RYACL_EXIT_FOUND);
+}
+
+}  // namespace
+
+int ryacl_cmd_diff(int argc, char **argv) {
+    return ryacl::out_of_memory_guard("diff", [&] { return run_diff(argc, argv); });
 }

@@ -23,6 +23,7 @@
 #include <cstring>
 #include <string>
 
+#include "acl_load.h"
 #include "ry_zo_int.h"
 #include "ryacl_cmd.h"
 
@@ -388,9 +389,7 @@ int editor_session::run() {
     return RYACL_EXIT_OK;
 }
 
-}  // namespace
-
-int ryacl_cmd_edit(int argc, char **argv) {
+int run_edit(int argc, char **argv) {
     static const option longopts[] = {
         {"no-cache", no_argument, nullptr, 'n'}, {"help", no_argument, nullptr, 'h'}, {nullptr, 0, nullptr, 0}};
     bool cache = true;
@@ -415,4 +414,10 @@ int ryacl_cmd_edit(int argc, char **argv) {
     install_handlers();
     editor_session session(argv[optind], cache);
     return session.run();
+}
+
+}  // namespace
+
+int ryacl_cmd_edit(int argc, char **argv) {
+    return ryacl::out_of_memory_guard("edit", [&] { return run_edit(argc, argv); });
 }

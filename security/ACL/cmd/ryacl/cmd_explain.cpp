@@ -71,22 +71,20 @@ int usage_error(const std::string &what) {
 std::string show(const std::string &s) { return zo::escape_controls(s); }
 
 // Where an entry stands, and the entry.
-std::string where(const loaded_acl &acl, const acl_item &e) {
+std::string where(const acl_item &e) {
     std::string at = e.line ? "line " + std::to_string(e.line) : std::string("cache file");
-    return at + ": " + show(ryacl::entry_text(acl, e));
+    return at + ": " + show(ryacl::entry_text(e));
 }
 
 int cmp(const std::string &name, const acl_item &e) {
     return zo::casecmp_len(name.c_str(), name.size(), e.id ? e.id : "", e.idlen);
 }
 
-const acl_sub *find_sub(const std::vector<acl_sub> &subs, const loaded_acl &acl, unsigned char type,
+const acl_sub *find_sub(const std::vector<acl_sub> &subs, unsigned char type,
                         const std::string &mech) {
-    std::string f = mech;
-    for (char &c : f) c = static_cast<char>(zo::fold(static_cast<unsigned char>(c)));
+    const bool named = type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_EXPANDED;
     for (const acl_sub &s : subs)
-        if (s.type == type && (type != SEC_ACLE_TYPE_USER && type != SEC_ACLE_TYPE_EXPANDED ? true : acl.folded[s.mech] == f))
-            return &s;
+        if (s.type == type && (!named || zo_strcasecmp_posix_1(mech.c_str(), s.mech) == 0)) return &s;
     return nullptr;
 }
 
@@ -111,21 +109,21 @@ int explain(const loaded_acl &acl, const request &rq) {
     case selector::anyother:
     case selector::unauthenticated: {
         const unsigned char type = rq.sel == selector::anyother ? SEC_ACLE_TYPE_ANYOTHER : SEC_ACLE_TYPE_UNAUTHENTICATED;
-        const acl_sub *s = find_sub(subs, acl, type, "");
+        const acl_sub *s = find_sub(subs, type, "");
         if (!s || s->items.empty()) {
             out = std::string("grant: none\nno entry matched: the ACL has no ") + ryacl::type_word(type) + " entry\n";
             status = RYACL_EXIT_FOUND;
             break;
         }
         const acl_item &e = acl.items[s->items.front()];
-        out = grant_line(e.perm) + "decided by " + where(acl, e) + "\n";
+        out = grant_line(e.perm) + "decided by " + where(e) + "\n";
         break;
     }
     case selector::identity:
     case selector::expanded: {
         const bool user = rq.sel == selector::identity;
         const unsigned char type = user ? SEC_ACLE_TYPE_USER : SEC_ACLE_TYPE_EXPANDED;
-        const acl_sub *s = find_sub(subs, acl, type, rq.mech);
+        const acl_sub *s = find_sub(subs, type, rq.mech);
         if (!s) {
             out = std::string("grant: none\nno entry matched: the ACL has no ") + ryacl::type_word(type) +
                   " entries of mechanism " + show(rq.mech) + "\n";
@@ -146,16 +144,16 @@ int explain(const loaded_acl &acl, const request &rq) {
         }
         if (!hit) {
             out = std::string("grant: none\nno entry matched: the ") + ryacl::type_word(type) + " entries of mechanism " +
-                  show(acl.mechs[s->mech]) + " (" + std::to_string(s->items.size()) + ", " + std::to_string(searched) +
+                  show(s->mech) + " (" + std::to_string(s->items.size()) + ", " + std::to_string(searched) +
                   " searched) hold no identity " + show(rq.id) + "\n";
             status = RYACL_EXIT_FOUND;
             break;
         }
-        out = grant_line(hit->perm) + "decided by " + where(acl, *hit) + "\n";
+        out = grant_line(hit->perm) + "decided by " + where(*hit) + "\n";
         break;
     }
     case selector::groups: {
-        const acl_sub *s = find_sub(subs, acl, SEC_ACLE_TYPE_GROUP, "");
+        const acl_sub *s = find_sub(subs, SEC_ACLE_TYPE_GROUP, "");
         if (!s) {
             out = "grant: none\nno entry matched: the ACL has no group entries\n";
             status = RYACL_EXIT_FOUND;
@@ -174,7 +172,7 @@ int explain(const loaded_acl &acl, const request &rq) {
             if (hit) {
                 perm |= hit->perm;
                 any = true;
-                lines += "group " + show(g) + ": " + where(acl, *hit) + "\n";
+                lines += "group " + show(g) + ": " + where(*hit) + "\n";
             } else {
                 lines += "group " + show(g) + ": no entry\n";
             }
@@ -213,9 +211,7 @@ bool split_groups(const char *arg, request &rq) {
     }
 }
 
-}  // namespace
-
-int ryacl_cmd_explain(int argc, char **argv) {
+int run_explain(int argc, char **argv) {
     enum { kIdentity = 256, kExpanded, kGroups, kAnyother, kUnauth };
     static const option longopts[] = {{"identity", required_argument, nullptr, kIdentity},
                                       {"expanded", required_argument, nullptr, kExpanded},
@@ -279,4 +275,10 @@ int ryacl_cmd_explain(int argc, char **argv) {
     const int status = explain(acl, rq);
     std::printf("read from: %s (%s)\n", show(acl.path).c_str(), acl.compiled ? "cache file, current" : "text");
     return ryacl_util::finish(status);
+}
+
+}  // namespace
+
+int ryacl_cmd_explain(int argc, char **argv) {
+    return ryacl::out_of_memory_guard("explain", [&] { return run_explain(argc, argv); });
 }
