@@ -70,6 +70,31 @@ TEST_F(RyaclDiff, ComparesCompiledAndTextInAnyMix) {
     EXPECT_EQ(r.out, "- u unix bob r\n+ g ops r\n");
 }
 
+// A compiled ACL made elsewhere may hold one key twice: the first counts,
+// as evaluation finds the first.
+TEST_F(RyaclDiff, CompiledDuplicateCountsOnce) {
+    std::string bytes = rytest::read_file(compiled("d.acl", "u unix alice r\nu unix blice w\n"));
+    const size_t at = bytes.find("blice");
+    ASSERT_NE(at, std::string::npos);
+    bytes[at] = 'A';
+    const std::string twice = acl("twice.cacl", bytes);
+    EXPECT_EQ(diff({twice, acl("r.acl", "u unix alice r\n")}).status, 0);
+    const auto r = diff({twice, acl("w.acl", "u unix alice w\n")});
+    EXPECT_EQ(r.status, 1);
+    EXPECT_EQ(r.out, "~ u unix alice r -> w\n");
+}
+
+// Memory that cannot be had is trouble with a message, never an abort.
+TEST_F(RyaclDiff, OutOfMemoryIsTroubleNotACrash) {
+    std::string big;
+    for (int i = 0; i < 200000; ++i) big += "u unix someone" + std::to_string(i) + "@node.example.com rw\n";
+    const std::string f = acl("big.acl", big);
+    const auto r = rytest::run({"/bin/sh", "-c", "ulimit -v 30000; exec \"$0\" diff \"$1\" \"$1\"", RYACL_PATH, f},
+                               "", {"LC_ALL=C", "NLSPATH"});
+    EXPECT_EQ(r.status, 2) << r.err;
+    EXPECT_TRUE(r.err.find("4471-102") != std::string::npos || r.err.find("out of memory") != std::string::npos) << r.err;
+}
+
 TEST_F(RyaclDiff, RefusesCorruptedForeignAndFaultyFilesWithTheNumberedMessage) {
     const std::string good = acl("good.acl", "o r\n");
     const std::string bytes = rytest::read_file(compiled("x.acl", "o rl\nu unix alice rw\n"));

@@ -41,7 +41,7 @@ std::string g_dir;
 const std::string &dir() {
     if (g_dir.empty()) {
         const char *t = std::getenv("TMPDIR");
-        std::string tmpl = std::string(t && *t ? t : "/tmp") + "/ryacl_bench_cmd.XXXXXX";
+        std::string tmpl = std::string(t && *t ? t : "/tmp") + "/ryacl_bench_diff.XXXXXX";
         std::vector<char> b(tmpl.begin(), tmpl.end());
         b.push_back('\0');
         if (!mkdtemp(b.data())) std::abort();
