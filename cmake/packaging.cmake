@@ -18,8 +18,8 @@ set(CPACK_PACKAGE_CONTACT "ryacl developers <dev@ryacl.local>")
 set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "ACL file checker, query command and ACL library")
 # The extended description; CPack puts the summary above it.
 set(CPACK_DEBIAN_PACKAGE_DESCRIPTION "ryaclfck checks access control list files for services before they are
-put to use, and caches their compiled form. ryaclq shows what an ACL
-grants to a client. libryacl reads ACL files into compiled ACLs, edits
+put to use, and caches their compiled form. ryacl checks, queries,
+lists, compares and edits them. libryacl reads ACL files into compiled ACLs, edits
 and lists them and evaluates permissions. Includes the headers, the
 static library, pkg-config and CMake files, the message catalog and the
 manual pages.")
@@ -27,8 +27,7 @@ set(CPACK_DEBIAN_PACKAGE_SECTION admin)
 set(CPACK_DEBIAN_PACKAGE_PRIORITY optional)
 set(CPACK_DEBIAN_FILE_NAME DEB-DEFAULT)
 # Installed under /usr whatever the build's own prefix; every path inside
-# the installation is relative (the .pc file, the CMake package, ryaclq's
-# $ORIGIN run path), so the package works from there as from a staging root.
+# the installation is relative (the .pc file, the CMake package), so the package works from there as from a staging root.
 set(CPACK_PACKAGING_INSTALL_PREFIX /usr)
 # Shipped binaries carry no debug information.
 set(CPACK_STRIP_FILES ON)
