@@ -154,11 +154,11 @@ bool write_all(int fd, const std::string &s) {
     return true;
 }
 
-// Read a regular file by name without following a link.  ENOENT is
-// reported as such so the caller can tell a new file.
+// Read a regular file by name without following a link: 0 or an errno
+// (EINVAL: not a regular file).
 int read_regular(const std::string &path, std::string &out, struct stat *st) {
     int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NOCTTY | O_NONBLOCK);
-    if (fd < 0) return errno == ELOOP ? EMLINK : errno;  // ELOOP: a link
+    if (fd < 0) return errno;  // ELOOP: a link
     int err = 0;
     if (fstat(fd, st) != 0) err = errno;
     else if (!S_ISREG(st->st_mode)) err = EINVAL;
@@ -356,7 +356,7 @@ int editor_session::run() {
         if (S_ISLNK(ls.st_mode)) return fail(file_ + " is a symbolic link; edit the file it names");
         int err = read_regular(file_, original_, &st_);
         if (err == EINVAL) return fail(file_ + " is not a regular file");
-        if (err) return fail("cannot read " + file_, err == EMLINK ? ELOOP : err);
+        if (err) return fail("cannot read " + file_, err);
         exists_ = true;
     } else if (errno != ENOENT) {
         return fail("cannot look at " + file_, errno);
@@ -385,8 +385,11 @@ int editor_session::run() {
         return RYACL_EXIT_OK;
     }
     if (int rc = commit()) return rc;
-    if (cache_ && ryacl_write_cache(file_.c_str()) != RYACL_EXIT_OK) return RYACL_EXIT_TROUBLE;
-    return RYACL_EXIT_OK;
+    if (!cache_) return RYACL_EXIT_OK;
+    // The cache writer's own temporary file is not one the handler knows:
+    // a signal waits until the cache is written or refused.
+    signals_blocked hold;
+    return ryacl_write_cache(file_.c_str()) == RYACL_EXIT_OK ? RYACL_EXIT_OK : RYACL_EXIT_TROUBLE;
 }
 
 int run_edit(int argc, char **argv) {
