@@ -9,3 +9,8 @@ if(Python3_FOUND)
     COMMAND ${Python3_EXECUTABLE} ${_formats} $<TARGET_FILE:ryacl_cmd> --validate)
   set_tests_properties(ryacl_check_sarif_validate PROPERTIES SKIP_RETURN_CODE 77 TIMEOUT 900)
 endif()
+
+# What the subcommands share with each other, tested in process.
+if(TARGET test_ryacl_cmd_api)
+  target_link_libraries(test_ryacl_cmd_api PRIVATE ryacl_cmd_objects)
+endif()

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <pwd.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -71,6 +72,31 @@ TEST(CliCheck, UserFileMustBeOwnedByTheUserAndWritableByNoOneElse) {
     EXPECT_TRUE(geteuid() != 0 || chmod(path.c_str(), 0644) != 0 || chown(path.c_str(), 65534, 65534) != 0 ||
                 rytest::run_ryaclfck({"-u", user, "-f", base}, "", {"LC_ALL=C"}).status == 36);  // someone else's
     unlink(path.c_str());
+}
+
+// A file that is there but cannot be opened (no descriptor left) is the
+// open's failure, with its errno: 156 for the checker, 124 for the library.
+TEST(CliCheck, AFileThatCannotBeOpenedReportsTheOpensErrno) {
+    struct last_fault final : acl__text_sink {
+        int32_t msg = 0;
+        void fault(int32_t, int32_t) override { msg = rytest::error_msgnum(); }
+    } sink;
+    rytest::tmp_dir d;
+    rytest::write_file(d / "acl", "n r\n");
+    struct rlimit old {};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &old), 0);
+    const int lowest = dup(0);
+    close(lowest);
+    const struct rlimit tight = {static_cast<rlim_t>(lowest), old.rlim_max};
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &tight), 0);
+    const int32_t fck = aclfck__check((d / "acl").c_str(), nullptr, 0, sink);
+    sec_buffer_desc acl{0, nullptr};
+    const int32_t lib = sec_read_acl_file((d / "acl").c_str(), nullptr, nullptr, SEC_ACLF_FROM_TEXT, &acl, nullptr);
+    const std::string text = rytest::error_text();
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &old), 0);
+    EXPECT_TRUE(fck == ACL_RC_FILE_ERROR && sink.msg == 156) << fck << " " << sink.msg;
+    EXPECT_TRUE(lib == ACL_RC_FILE_ERROR && rytest::error_msgnum() == 124 && !acl.value) << lib;
+    EXPECT_NE(text.find(std::to_string(EMFILE)), std::string::npos) << text;
 }
 
 // In process: a memory failure is never a fault of the file, so it ends

@@ -126,6 +126,10 @@ TEST(RyaclCheck, StandardInputAndEscapedControlCharacters) {
     EXPECT_NE(json.out.find("identity: A\\u001b]0;X\\u0007."), npos) << json.out;
     const auto empty = rytest::run({"/bin/sh", "-c", std::string(RYACL_CMD_PATH) + " check - < /dev/null"});
     EXPECT_TRUE(empty.status == 0 && empty.out.empty()) << empty.out;
+    const auto closed = rytest::run({"/bin/sh", "-c", std::string(RYACL_CMD_PATH) + " check - <&-"});
+    EXPECT_TRUE(closed.status == 2 && closed.err.rfind("-: ryacl: standard input: ", 0) == 0) << closed.err;
+    const auto full = rytest::run({"/bin/sh", "-c", std::string(RYACL_CMD_PATH) + " --help > /dev/full"});
+    EXPECT_TRUE(full.status == 2 && full.err.find("ryacl: standard output: ") != npos) << full.err;
 }
 
 // --cache stores what ryaclfck -s stores, with the file's mode; only for

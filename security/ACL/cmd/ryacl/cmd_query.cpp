@@ -353,7 +353,9 @@ int run(options &o, int argc, char **argv) {
     if (rc == 0) rc = sec_convert_acl_to_host(1, &acl);
     if (rc != 0) {
         report_current_error("sec_convert_acl_to_host", rc);
-        sec_release_acl(&acl);
+        // sec_release_acl refuses bytes that are not a compiled ACL; they
+        // are still the library's malloc block.
+        std::free(acl.value);
         return RYACL_EXIT_TROUBLE;
     }
 
