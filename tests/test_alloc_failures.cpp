@@ -12,6 +12,7 @@
 #include "lib_acl_bytes.h"
 #include "ry_zo_int.h"
 #include "ryacl_alloc.h"
+#include "ryacl_error.h"
 #include "ryacl_acl_edit.h"
 #include "ryacl_init.h"
 #include "ryacl_utils.h"
