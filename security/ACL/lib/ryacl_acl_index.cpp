@@ -63,29 +63,47 @@ uint64_t process_seed() {
     return seed;
 }
 
-// Up to eight bytes of a text that may end anywhere: nothing past it is read.
-inline uint64_t load_tail(const char *p, size_t n) {
-    uint64_t v = 0;
-    std::memcpy(&v, p, n);
-    return v;
+// The first 16 bytes of an identifier as the comparison sees them: ASCII
+// capitals folded, bytes past its end zero.  Read whole words from a text
+// with at least 16 readable bytes (the index's copy is padded for this), or
+// from a stack copy of a caller's shorter text.
+struct head16 {
+    uint64_t a, b;
+};
+inline uint64_t low_bytes(uint64_t w, size_t n) { return n >= 8 ? w : w & ((uint64_t{1} << (8 * n)) - 1); }
+inline head16 head_padded(const char *p, size_t len) {
+    return {zo::fold8(low_bytes(zo::load8(p), len)), zo::fold8(low_bytes(zo::load8(p + 8), len > 8 ? len - 8 : 0))};
+}
+inline head16 head_of(const char *p, size_t len) {
+    if (len >= 16) return head_padded(p, len);
+    char buf[16] = {};
+    std::memcpy(buf, p, len);
+    return head_padded(buf, len);
 }
 
-// Hash of a text of known length as the comparison sees it (ASCII letters
-// folded), so identifiers that compare equal hash equal.
-uint64_t text_hash(const char *p, size_t len, uint64_t seed) {
-    uint64_t h = seed ^ (len * kMixA);
-    size_t i = 0;
-    for (; len - i > 16; i += 16)
-        h = mum(zo::fold8(zo::load8(p + i)) ^ h ^ kMixB, zo::fold8(zo::load8(p + i + 8)) ^ kMixC);
-    const size_t rest = len - i;
-    uint64_t a, b = 0;
-    if (rest > 8) {
-        a = zo::fold8(zo::load8(p + i));
-        b = zo::fold8(load_tail(p + i + 8, rest - 8));
-    } else {
-        a = zo::fold8(load_tail(p + i, rest));
+// Hash of an identifier as the comparison sees it, so identifiers that
+// compare equal hash equal.  Past 16 bytes, 8 at a time.
+// `padded`: whole words may be read past the end, as in the copy.
+template <bool padded>
+uint64_t text_hash(const head16 &k, const char *p, size_t len, uint64_t seed) {
+    uint64_t h = mum(k.a ^ seed, k.b ^ kMixA);
+    if (len <= 16) return h;
+    for (size_t i = 16; i < len; i += 8) {
+        uint64_t w = 0;
+        if constexpr (padded) w = low_bytes(zo::load8(p + i), len - i);
+        else std::memcpy(&w, p + i, len - i < 8 ? len - i : 8);
+        h = mum(h ^ zo::fold8(w), kMixB);
     }
-    return mum(mum(a ^ h ^ kMixB, b ^ kMixC) ^ kMixA, h ^ kMixB);
+    return mum(h, kMixC ^ len);
+}
+
+// Order of two identifiers as the comparison gives it, from their heads
+// where those differ.
+inline int order(const head16 &x, const char *p, size_t plen, const head16 &y, const char *q, size_t qlen) {
+    if (x.a != y.a) return __builtin_bswap64(x.a) < __builtin_bswap64(y.a) ? -1 : 1;
+    if (x.b != y.b) return __builtin_bswap64(x.b) < __builtin_bswap64(y.b) ? -1 : 1;
+    if (plen <= 16 && qlen <= 16) return 0;
+    return zo::casecmp_len(p, plen, q, qlen);
 }
 
 // Slot of an identifier table: the low bits of its hash with bit 0 telling
@@ -157,11 +175,16 @@ namespace {
 
 constexpr const char *kCreate = "sec_create_acl_index";
 
-void *index_alloc(size_t count, size_t size, int32_t *rc) {
-    void *p = acl__calloc(count, size);
+// Zeroed blocks, but for the copy, which is written over at once.
+void *index_alloc(size_t count, size_t size, int32_t *rc, bool zeroed = true) {
+    void *p = zeroed ? acl__calloc(count, size) : acl__malloc(count * size);
     if (!p) *rc = acl::set_error(ACL_RC_NO_MEMORY, 89, kCreate, static_cast<int32_t>(count * size));
     return p;
 }
+
+// Zero bytes after the copy: whole-word reads of its last identifier stay
+// inside the block.
+constexpr size_t kPad = 16;
 
 void release(sec_acl_index_s *ix) {
     if (!ix) return;
@@ -239,35 +262,63 @@ size_t map_subs(sec_acl_index_s *ix, size_t len) {
     return nslots;
 }
 
-// Fill one sub-ACL's identifier table from its entries, in order.
+// Insert one entry unless an earlier entry of its identifier is there.
+inline void insert(const sec_acl_index_s *ix, id_slot *t, uint32_t n, uint32_t i, uint64_t h, uint32_t key,
+                   uint32_t off, const char *id, size_t len) {
+    for (;; i = i + 1 == n ? 0 : i + 1) {
+        id_slot &slot = t[i];
+        if (!slot.off) {
+            slot.key = key;
+            slot.off = off;
+            return;
+        }
+        // A later entry of the same identifier is never the walk's answer.
+        if (same_key(slot.key, h)) {
+            const unsigned char *o = ix->bytes + slot.off;
+            if (zo::casecmp_len(id, len, reinterpret_cast<const char *>(o + ACL_ENTRY_HDR_SIZE),
+                                acl__load_le16(o + 5) - 1u) == 0)
+                return;
+        }
+    }
+}
+
+// Fill one sub-ACL's identifier table from its entries, in order.  Entries
+// go in by batches whose slots are fetched ahead, so the table's cache
+// misses overlap instead of following one another.
 void fill_table(const sec_acl_index_s *ix, const sub_info &s) {
+    constexpr uint32_t kBatch = 16;
+    struct pending {
+        uint64_t h;
+        uint32_t key, off, slot;
+        const char *id;
+        size_t len;
+    } batch[kBatch];
     id_slot *t = ix->slots + s.slot0;
     const unsigned char *e = ix->bytes + s.first;
-    const char *top = nullptr;  // the highest identifier so far
+    head16 top{};  // the highest identifier so far
+    const char *topid = nullptr;
     size_t toplen = 0;
-    for (uint32_t k = 0; k < s.count; ++k) {
-        const size_t idlen = acl__load_le16(e + 5);
-        const char *id = reinterpret_cast<const char *>(e + ACL_ENTRY_HDR_SIZE);
-        const size_t len = idlen - 1;
-        const bool reached = !top || zo::casecmp_len(id, len, top, toplen) > 0;
-        if (reached) top = id, toplen = len;
-        const uint64_t h = text_hash(id, len, ix->seed);
-        for (uint32_t i = slot_of(h, s.nslots);; i = i + 1 == s.nslots ? 0 : i + 1) {
-            id_slot &slot = t[i];
-            if (!slot.off) {
-                slot.key = (static_cast<uint32_t>(h) & ~kReached) | (reached ? kReached : 0);
-                slot.off = static_cast<uint32_t>(e - ix->bytes);
-                break;
-            }
-            // A later entry of the same identifier is never the walk's answer.
-            if (same_key(slot.key, h)) {
-                const unsigned char *o = ix->bytes + slot.off;
-                if (zo::casecmp_len(id, len, reinterpret_cast<const char *>(o + ACL_ENTRY_HDR_SIZE),
-                                    acl__load_le16(o + 5) - 1u) == 0)
-                    break;
-            }
+    for (uint32_t done = 0; done < s.count;) {
+        const uint32_t n = s.count - done < kBatch ? s.count - done : kBatch;
+        for (uint32_t k = 0; k < n; ++k) {
+            const size_t idlen = acl__load_le16(e + 5);
+            const char *id = reinterpret_cast<const char *>(e + ACL_ENTRY_HDR_SIZE);
+            const size_t len = idlen - 1;
+            const head16 head = head_padded(id, len);
+            const bool reached = !topid || order(head, id, len, top, topid, toplen) > 0;
+            if (reached) top = head, topid = id, toplen = len;
+            const uint64_t h = text_hash<true>(head, id, len, ix->seed);
+            const uint32_t slot = slot_of(h, s.nslots);
+            __builtin_prefetch(t + slot, 1);
+            batch[k] = {h, (static_cast<uint32_t>(h) & ~kReached) | (reached ? kReached : 0),
+                        static_cast<uint32_t>(e - ix->bytes), slot, id, len};
+            e += ACL_ENTRY_HDR_SIZE + idlen;
         }
-        e += ACL_ENTRY_HDR_SIZE + idlen;
+        for (uint32_t k = 0; k < n; ++k) {
+            const pending &b = batch[k];
+            insert(ix, t, s.nslots, b.slot, b.h, b.key, b.off, b.id, b.len);
+        }
+        done += n;
     }
 }
 
@@ -294,10 +345,11 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     if (!ix) return rc;
     ix->seed = process_seed();
     ix->mech_mask = static_cast<uint32_t>(nmech - 1);
-    if ((ix->bytes = static_cast<unsigned char *>(index_alloc(len, 1, &rc))) &&
+    if ((ix->bytes = static_cast<unsigned char *>(index_alloc(len + kPad, 1, &rc, false))) &&
         (ix->subs = static_cast<sub_info *>(index_alloc(nsub ? nsub : 1, sizeof(sub_info), &rc))) &&
         (ix->mechs = static_cast<mech_slot *>(index_alloc(nmech, sizeof(mech_slot), &rc)))) {
         std::memcpy(ix->bytes, p, len);
+        std::memset(ix->bytes + len, 0, kPad);
         const size_t nslots = map_subs(ix, len);
         if ((ix->slots = static_cast<id_slot *>(index_alloc(nslots ? nslots : 1, sizeof(id_slot), &rc)))) {
             for (uint32_t s = 0; s < ix->nsubs; ++s)
@@ -319,7 +371,7 @@ int32_t no_entry(unsigned type, const char *mech, const char *id) {
 // The first entry of `id` in a user or group sub-ACL, when the walk reaches
 // it; null otherwise.
 const unsigned char *probe(const sec_acl_index_s *ix, const sub_info &s, const char *id, size_t len) {
-    const uint64_t h = text_hash(id, len, ix->seed);
+    const uint64_t h = text_hash<false>(head_of(id, len), id, len, ix->seed);
     const id_slot *t = ix->slots + s.slot0;
     for (uint32_t i = slot_of(h, s.nslots);; i = i + 1 == s.nslots ? 0 : i + 1) {
         const id_slot &slot = t[i];
