@@ -230,18 +230,18 @@ int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan,
 //  - an identifier of types 4, 8 or 16 whose length field is 0 or whose
 //    text does not end exactly at its length: 43 with message 114.
 // Entry versions are not looked at, as before.
-int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree_t *tree) {
+int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree_t *tree, size_t *used) {
     if (!tree) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 3, 0);
     *tree = nullptr;
     if (!p) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 1, 0);
     if (avail < ACL_SUBACL_HDR_SIZE) return bad_structure(__LINE__);
-    const unsigned char type = p[4];
-    const uint32_t count = acl__load_le32(p + 5);
-    const size_t mechlen = p[9];
+    const acl__subacl s = acl__subacl_alone(p, avail);
+    const unsigned char type = s.type;
+    const size_t mechlen = s.mechlen;
     if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, 107, type, ACL_LOC_ACL);
-    if ((type == SEC_ACLE_TYPE_UNAUTHENTICATED || type == SEC_ACLE_TYPE_ANYOTHER) && count > 1)
+    if ((type == SEC_ACLE_TYPE_UNAUTHENTICATED || type == SEC_ACLE_TYPE_ANYOTHER) && s.count > 1)
         return acl::set_error(ACL_RC_BAD_ACL, 98);
-    if (ACL_SUBACL_HDR_SIZE + mechlen > avail) return bad_structure(__LINE__);
+    if (!s.header_fits()) return bad_structure(__LINE__);
     char mech[kMechField] = {};
     const bool with_mech = acl__type_has_mech(type);
     if (with_mech) {
@@ -253,40 +253,34 @@ int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree
     }
     // Types 1, 2 and 16 carry no mechanism; a length field there is skipped
     // over, as the entries are located after it.
-    size_t pos = ACL_SUBACL_HDR_SIZE + mechlen;
     const bool with_id = acl__type_has_id(type);
-    const size_t sublen = acl__load_le32(p);
+    const size_t sublen = s.length;
     const size_t bound = sublen < avail ? sublen : avail;  // only a sizing hint
+    acl__entry_cursor<> entries(p, s, avail);
+    acl__entry e;
     sec_acltree_t t = nullptr;
     int32_t rc = 0;
-    for (uint32_t k = 0; k < count; ++k) {
-        if (avail - pos < ACL_ENTRY_HDR_SIZE) {
+    for (int r; (r = entries.next(&e)) != 0;) {
+        if (r < 0) {
             rc = bad_structure(__LINE__);
             break;
         }
-        const unsigned char *e = p + pos;
-        const uint32_t perm = acl__load_le32(e + 1);
-        const size_t idlen = acl__load_le16(e + 5);
-        if (avail - pos - ACL_ENTRY_HDR_SIZE < idlen) {
-            rc = bad_structure(__LINE__);
-            break;
-        }
-        const char *id = reinterpret_cast<const char *>(e + ACL_ENTRY_HDR_SIZE);
-        if (with_id && (idlen == 0 || std::memchr(id, '\0', idlen) != id + idlen - 1)) {
+        const size_t idlen = e.idlen;
+        if (with_id && (idlen == 0 || std::memchr(e.id, '\0', idlen) != e.id + idlen - 1)) {
             rc = acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
             break;
         }
         // A sub-ACL holding one identifier twice keeps the later permission.
-        rc = acl__tree_insert(&t, 0, type, perm, mech, with_mech ? mechlen - 1 : 0, with_id ? id : "",
+        rc = acl__tree_insert(&t, 0, type, e.perm, mech, with_mech ? mechlen - 1 : 0, with_id ? e.id : "",
                               with_id ? idlen - 1 : 0);
         if (rc) break;
-        pos += ACL_ENTRY_HDR_SIZE + idlen;
-        if (k == 0 && count > 1) {
+        if (e.off == s.entries() && s.count > 1) {
             // Grow once.  The counts may lie, so the room asked for is what
             // the bytes present could hold, not what the header claims.
+            const size_t pos = entries.pos();
             size_t rest = bound > pos ? bound - pos : 0;
             size_t more = rest / (ACL_ENTRY_HDR_SIZE + (with_id ? 1 : 0));
-            if (more > count - 1) more = count - 1;
+            if (more > s.count - 1) more = s.count - 1;
             rc = acl__tree_reserve(&t, more, rest);
             if (rc) break;
         }
@@ -296,42 +290,38 @@ int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree
         return rc;
     }
     *tree = t;
+    if (used) *used = entries.pos();
     return 0;
+}
+
+bool acl__find_subacl(const sec_acl_buffer_desc *acl, unsigned char type, const char *mech,
+                      acl__subacl *found) {
+    if (!acl || !acl->value || acl->length < ACL_HDR_SIZE) return false;
+    const auto *p = static_cast<const unsigned char *>(acl->value);
+    const bool by_mech = acl__type_has_mech(type);
+    // Without a mechanism a user or expanded sub-ACL cannot be named.
+    if (by_mech && !mech) return false;
+    acl__subacl_cursor<> subs(p, static_cast<size_t>(acl->length));
+    acl__subacl s;
+    // A sub-ACL that cannot be located ends the search: nothing behind it
+    // can be either.
+    while (subs.next(&s) == 1) {
+        if (s.type != type) continue;
+        const size_t mlen = s.mechlen;
+        if (!by_mech || (mlen >= 1 && mlen <= kMechField && s.header_fits() &&
+                         p[s.off + ACL_SUBACL_HDR_SIZE + mlen - 1] == '\0' &&
+                         zo_strcasecmp_posix_1(mech, reinterpret_cast<const char *>(p + s.off + ACL_SUBACL_HDR_SIZE)) == 0)) {
+            *found = s;
+            return true;
+        }
+    }
+    return false;
 }
 
 int32_t sec__find_subacl(const sec_acl_buffer_desc *acl, unsigned char type, const char *mech,
                          unsigned char **subacl) {
     if (!subacl) return 0;
-    *subacl = nullptr;
-    if (!acl || !acl->value || acl->length < ACL_HDR_SIZE) return 0;
-    auto *p = static_cast<unsigned char *>(acl->value);
-    const size_t len = static_cast<size_t>(acl->length);
-    const unsigned nsub = acl__load_le16(p + 3);
-    const bool by_mech = acl__type_has_mech(type);
-    // Without a mechanism a user or expanded sub-ACL cannot be named.
-    if (by_mech && !mech) return 0;
-    size_t pos = ACL_HDR_SIZE;
-    for (unsigned k = 0; k < nsub; ++k) {
-        if (len - pos < ACL_SUBACL_HDR_SIZE) return 0;
-        const size_t sublen = acl__load_le32(p + pos);
-        // A length of 0 would never move on, one past the end has nothing
-        // behind it to find: either ends the walk.
-        if (sublen < ACL_SUBACL_HDR_SIZE || sublen > len - pos) return 0;
-        const unsigned char *s = p + pos;
-        if (s[4] == type) {
-            if (!by_mech) {
-                *subacl = p + pos;
-                return 0;
-            }
-            const size_t mechlen = s[9];
-            if (mechlen >= 1 && mechlen <= kMechField && ACL_SUBACL_HDR_SIZE + mechlen <= sublen &&
-                s[ACL_SUBACL_HDR_SIZE + mechlen - 1] == '\0' &&
-                zo_strcasecmp_posix_1(mech, reinterpret_cast<const char *>(s + ACL_SUBACL_HDR_SIZE)) == 0) {
-                *subacl = p + pos;
-                return 0;
-            }
-        }
-        pos += sublen;
-    }
+    acl__subacl s;
+    *subacl = acl__find_subacl(acl, type, mech, &s) ? static_cast<unsigned char *>(acl->value) + s.off : nullptr;
     return 0;
 }

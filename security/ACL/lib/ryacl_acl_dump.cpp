@@ -114,18 +114,19 @@ void sec__dump_acl(sec_acl_buffer_t acl) {
         emit(stderr, true);
         return;
     }
-    const unsigned nsub = acl__load_le16(p + 3);
+    acl__subacl_cursor<> subs(p, len, acl__walk::lenient);
     acl::set_error(ACL_RC_INFO, 83, acl->length, static_cast<int>(p[1]), static_cast<int>(p[2]),
-                   static_cast<int>(nsub));
+                   static_cast<int>(acl__load_le16(p + 3)));
     emit(stderr, false);
-    size_t pos = ACL_HDR_SIZE;
-    for (unsigned k = 0; k < nsub; ++k) {
-        sec__dump_subacl(p + pos, len - pos, "\t");
-        if (len - pos < ACL_SUBACL_HDR_SIZE) break;
-        // A length field of 0 or one running past the end leaves nothing
-        // further that can be located.
-        const size_t sublen = acl__load_le32(p + pos);
-        if (sublen == 0 || sublen > len - pos) break;
-        pos += sublen;
+    // Each sub-ACL is shown with the bytes up to the end of the block, as
+    // its entries are located by their count.  One that cannot be located
+    // (its header or length running past the block, or the length before
+    // it not covering that one's header) ends the dump with message 97.
+    acl__subacl s;
+    int r;
+    while ((r = subs.next(&s)) == 1) sec__dump_subacl(p + s.off, s.avail, "\t");
+    if (r < 0) {
+        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        emit(stdout, false);
     }
 }

@@ -1,9 +1,9 @@
 // Permission evaluation: what a compiled ACL grants to one identity, or to
 // a set of groups.  Works on the caller's bytes in place: no allocation, no
-// copy, no tree.  The buffer may not have been validated, so every entry is
-// bounds-checked against the block before it is read; a walk that runs off
-// the block reports the buffer as corrupted (97), and an identifier whose
-// length does not end on its NUL is reported as validation would (114).
+// copy, no tree.  The buffer may not have been validated: the cursor reads
+// every entry within the block; a walk that runs off the block reports the
+// buffer as corrupted (97), and an identifier whose length does not end on
+// its NUL is reported as validation would (114).
 #include <cstring>
 
 #include "ry_zo_int.h"
@@ -29,51 +29,11 @@ int32_t check_acl(const sec_acl_buffer_desc *acl) {
     return 0;
 }
 
-// The entries of one sub-ACL, walked within the block.
-class entry_walk {
-public:
-    // False when the sub-ACL header itself runs off the block.
-    bool open(const sec_acl_buffer_desc *acl, const unsigned char *sub) {
-        end_ = static_cast<const unsigned char *>(acl->value) + acl->length;
-        if (end_ - sub < ACL_SUBACL_HDR_SIZE) return false;
-        const unsigned mlen = sub[9];
-        if (static_cast<size_t>(end_ - sub) < ACL_SUBACL_HDR_SIZE + size_t{mlen}) return false;
-        left_ = acl__load_le32(sub + 5);
-        cur_ = sub + ACL_SUBACL_HDR_SIZE + mlen;
-        return true;
-    }
-    uint32_t count_left() const { return left_; }
-    // Step to the next entry.  1: *perm and *id (null for an entry without
-    // an identifier) describe it; 0: no entries left; otherwise the return
-    // code of a corrupted entry, with the error recorded.
-    int32_t next(bool with_id, uint32_t *perm, const char **id, size_t *idtextlen = nullptr) {
-        if (left_ == 0) return 0;
-        if (end_ - cur_ < ACL_ENTRY_HDR_SIZE) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
-        const size_t idlen = acl__load_le16(cur_ + 5);
-        if (static_cast<size_t>(end_ - cur_ - ACL_ENTRY_HDR_SIZE) < idlen)
-            return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
-        *perm = acl__load_le32(cur_ + 1);
-        const char *text = reinterpret_cast<const char *>(cur_ + ACL_ENTRY_HDR_SIZE);
-        if (with_id) {
-            // Handlers and comparisons get the identifier in place; it must
-            // end inside its own length.
-            if (idlen == 0 || text[idlen - 1] != '\0')
-                return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
-            *id = text;
-            if (idtextlen) *idtextlen = idlen - 1;
-        } else {
-            *id = nullptr;
-        }
-        cur_ += ACL_ENTRY_HDR_SIZE + idlen;
-        --left_;
-        return 1;
-    }
+int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, 97, "security/ACL/lib/ryacl_acl", line); }
 
-private:
-    const unsigned char *cur_ = nullptr;
-    const unsigned char *end_ = nullptr;
-    uint32_t left_ = 0;
-};
+// Handlers and comparisons get an identifier in place: it must end on the
+// NUL inside its own length (114 otherwise).
+bool id_ends(const acl__entry &e) { return e.idlen != 0 && e.id[e.idlen - 1] == '\0'; }
 
 int32_t no_entry(unsigned type, const char *mech, const char *id) {
     return acl::set_error(ACL_RC_BAD_ACLE, 134, type, mech ? mech : "", id ? id : "");
@@ -93,22 +53,25 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
     if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, 117);
 
     *perm = 0;
-    unsigned char *sub = nullptr;
-    sec__find_subacl(acl, static_cast<unsigned char>(acletype), zmech ? zmech : mech, &sub);
-    if (!sub) return no_entry(type, mech, nullptr);
-    entry_walk walk;
-    if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+    acl__subacl s;
+    if (!acl__find_subacl(acl, static_cast<unsigned char>(acletype), zmech ? zmech : mech, &s))
+        return no_entry(type, mech, nullptr);
+    // The entries are read up to the end of the block, the sub-ACL's length
+    // not consulted.
+    const auto *base = static_cast<const unsigned char *>(acl->value);
+    acl__entry_cursor<> walk(base, s, static_cast<size_t>(acl->length));
+    if (!walk.started()) return corrupted(__LINE__);
 
-    uint32_t eperm = 0;
-    const char *eid = nullptr;
+    acl__entry e;
+    int r;
     if (!named) {
-        if (walk.count_left() > 1) return acl::set_error(ACL_RC_BAD_ACL, 109, ACL_LOC_ACL);
+        if (s.count > 1) return acl::set_error(ACL_RC_BAD_ACL, 109, ACL_LOC_ACL);
         // A sub-ACL of no entries (made outside the library) grants nothing
         // and is reported as a missing entry.
-        int32_t r = walk.next(false, &eperm, &eid);
+        r = walk.next(&e);
         if (r == 0) return no_entry(type, mech, nullptr);
-        if (r != 1) return r;
-        *perm = eperm;
+        if (r < 0) return corrupted(__LINE__);
+        *perm = e.perm;
         return 0;
     }
 
@@ -124,26 +87,21 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
 
     const bool ordered = acletype == SEC_ACLE_TYPE_USER;
     const size_t idlen = std::strlen(id);
-    size_t eidlen = 0;
-    int32_t r;
-    while ((r = walk.next(true, &eperm, &eid, &eidlen)) == 1) {
-        int c;
-        c = handler ? handler(id, eid) : zo::casecmp_len(id, idlen, eid, eidlen);
+    while ((r = walk.next(&e)) == 1) {
+        if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+        const int c = handler ? handler(id, e.id) : zo::casecmp_len(id, idlen, e.id, e.idlen - 1u);
         if (c == 0) {
             // What a handler records is its own affair, never the caller's;
             // every other way out records its own error over it.
             if (handler) acl::clear_error();
-            *perm = eperm;
+            *perm = e.perm;
             return 0;
         }
         // User entries are stored in ascending order: nothing after an
         // entry that orders after the identity can match.
         if (c < 0 && ordered) break;
     }
-    if (r > 1) {
-        *perm = 0;
-        return r;
-    }
+    if (r < 0) return corrupted(__LINE__);
     return no_entry(type, mech, id);
 }
 
@@ -159,31 +117,31 @@ int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uin
 
     *perm = 0;
     if (count == 0) return 0;
-    unsigned char *sub = nullptr;
-    sec__find_subacl(acl, SEC_ACLE_TYPE_GROUP, nullptr, &sub);
-    if (!sub) return no_entry(SEC_ACLE_TYPE_GROUP, nullptr, nullptr);
+    acl__subacl s;
+    if (!acl__find_subacl(acl, SEC_ACLE_TYPE_GROUP, nullptr, &s)) return no_entry(SEC_ACLE_TYPE_GROUP, nullptr, nullptr);
 
+    const auto *base = static_cast<const unsigned char *>(acl->value);
+    const size_t len = static_cast<size_t>(acl->length);
     uint32_t result = 0;
     bool matched = false;
     for (int32_t g = 0; g < count; ++g) {
         const char *name = static_cast<const char *>(groups[g].value);
         const size_t namelen = std::strlen(name);
-        entry_walk walk;
-        if (!walk.open(acl, sub)) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
-        uint32_t eperm = 0;
-        const char *eid = nullptr;
-        size_t eidlen = 0;
-        int32_t r;
-        while ((r = walk.next(true, &eperm, &eid, &eidlen)) == 1) {
-            int c = zo::casecmp_len(name, namelen, eid, eidlen);
+        acl__entry_cursor<> walk(base, s, len);
+        if (!walk.started()) return corrupted(__LINE__);
+        acl__entry e;
+        int r;
+        while ((r = walk.next(&e)) == 1) {
+            if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+            const int c = zo::casecmp_len(name, namelen, e.id, e.idlen - 1u);
             if (c == 0) {
-                result |= eperm;
+                result |= e.perm;
                 matched = true;
                 break;
             }
             if (c < 0) break;
         }
-        if (r > 1) return r;
+        if (r < 0) return corrupted(__LINE__);
     }
     if (!matched) return no_entry(SEC_ACLE_TYPE_GROUP, nullptr, nullptr);
     *perm = result;
