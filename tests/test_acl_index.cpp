@@ -109,7 +109,7 @@ TEST(IndexEvaluation, AnswersAsTheWalkOnTheBytesItWasMadeFrom) {
                               subacl(16, "", {{16, "zz"}}), subacl(8, "hnd", {{1, "x/2"}, {2, "x/1"}}), subacl(2, "", {}),
                               subacl(1, "", {{0x20, ""}}), subacl(4, "late", {{1, "a"}})});
     bytes cut = b;
-    cut[b.size() - 24] = 12;  // the last sub-ACL's length no longer covers its mechanism
+    cut[b.size() - 24] = 12;  // the last sub-ACL's length field short of its mechanism
     for (const bytes &acl : {b, cut}) {
         sec_acl_index_t ix = index_of(acl);
         sec_buffer_desc d = own(acl);

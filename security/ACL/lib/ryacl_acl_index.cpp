@@ -211,17 +211,14 @@ const sub_info *find_sub(const sec_acl_index_s *ix, unsigned type, const char *m
     }
 }
 
-// Record the sub-ACLs the walk can find, in a buffer that validated.  The
-// walk takes the first match and stops at a length too short to hold a
-// sub-ACL header; a user or expanded sub-ACL whose length does not cover
-// its mechanism is passed over.  Returns the identifier slots needed.
-size_t map_subs(sec_acl_index_s *ix, size_t len) {
+// Record the sub-ACLs the walk can find, in a buffer that validated: the
+// first of each type (and mechanism), the last sub-ACL whatever its length
+// field says.  Returns the identifier slots needed.
+size_t map_subs(sec_acl_index_s *ix) {
     const unsigned char *p = ix->bytes;
     const unsigned nsub = acl__load_le16(p + 3);
     size_t pos = ACL_HDR_SIZE, nslots = 0;
     for (unsigned k = 0; k < nsub; ++k) {
-        const size_t sublen = acl__load_le32(p + pos);
-        if (sublen < ACL_SUBACL_HDR_SIZE || sublen > len - pos) break;
         const unsigned type = p[pos + 4];
         const size_t mlen = p[pos + 9];
         const bool by_mech = acl__type_has_mech(type);
@@ -230,7 +227,7 @@ size_t map_subs(sec_acl_index_s *ix, size_t len) {
         if (!by_mech) {
             owner = &ix->by_type[plain_slot(type)];
             if (*owner) owner = nullptr;
-        } else if (ACL_SUBACL_HDR_SIZE + mlen <= sublen) {
+        } else {
             uint64_t w[2];
             mech_key(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen - 1, w);
             uint32_t i = static_cast<uint32_t>(mech_hash(w, type, ix->seed)) & ix->mech_mask;
@@ -257,7 +254,7 @@ size_t map_subs(sec_acl_index_s *ix, size_t len) {
                 nslots += s.nslots;
             }
         }
-        pos += sublen;
+        pos += acl__load_le32(p + pos);
     }
     return nslots;
 }
@@ -350,7 +347,7 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
         (ix->mechs = static_cast<mech_slot *>(index_alloc(nmech, sizeof(mech_slot), &rc)))) {
         std::memcpy(ix->bytes, p, len);
         std::memset(ix->bytes + len, 0, kPad);
-        const size_t nslots = map_subs(ix, len);
+        const size_t nslots = map_subs(ix);
         if ((ix->slots = static_cast<id_slot *>(index_alloc(nslots ? nslots : 1, sizeof(id_slot), &rc)))) {
             for (uint32_t s = 0; s < ix->nsubs; ++s)
                 if (ix->subs[s].nslots) fill_table(ix, ix->subs[s]);
