@@ -24,7 +24,7 @@
 #include "ryacl_error.h"
 #include "ryacl_trace.h"
 
-bool acl__edit_direct_enabled = true;
+std::atomic<bool> acl__edit_direct_enabled{true};
 
 namespace {
 
@@ -341,7 +341,7 @@ int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl)
     int32_t rc = locate(acl, &e, &where);
     if (!rc) {
         rc = -1;
-        if (where.found && direct_road(e.type) && acl__edit_direct_enabled)
+        if (where.found && direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
             rc = direct_add(noupdate, &e, acl, where.s);
         if (rc == -1) rc = tree_add(noupdate, &e, acl, where);
     }
@@ -364,7 +364,8 @@ int32_t del_entry(sec_acle_t acle, sec_acl_buffer_t acl) {
     if (!where.found)
         return acl::set_error(ACL_RC_NO_MATCH, 105, e.type, e.mech, e.id ? e.id : "");
     int32_t rc = -1;
-    if (direct_road(e.type) && acl__edit_direct_enabled) rc = direct_del(&e, acl, where.s);
+    if (direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
+        rc = direct_del(&e, acl, where.s);
     if (rc == -1) rc = tree_del(&e, acl, where);
     return rc;
 }

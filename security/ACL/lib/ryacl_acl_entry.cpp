@@ -19,7 +19,7 @@ namespace trace = acl::trace;
 
 extern "C" {
 
-sec_perm_desc acl__default_perm_list[13] = {
+const sec_perm_desc acl__default_perm_list[13] = {
     {0x00000001u, 'r', "read", "general purpose read operation"},
     {0x00000002u, 'w', "write", "general purpose write operation"},
     {0x00000004u, 'c', "control", "general purpose control operation"},
@@ -35,7 +35,9 @@ sec_perm_desc acl__default_perm_list[13] = {
     {0x00001000u, 'o', "set", "HVT online/offline/reset resource"},
 };
 
-sec_perm_set_desc acl__default_perm_set = {13, acl__default_perm_list};
+// The record's pointer is not const-qualified (it is the public template set
+// type); nothing writes through it, and the templates stay in read-only memory.
+const sec_perm_set_desc acl__default_perm_set = {13, const_cast<sec_perm_t>(acl__default_perm_list)};
 
 }  // extern "C"
 
@@ -220,7 +222,7 @@ int32_t sec__create_acle(unsigned char type, uint32_t perm, const char *mech, co
     return create_acle(type, perm, mech, id, translate, acle);
 }
 
-int32_t sec__translate_perms(const char *ps, sec_perm_set_t permset, uint32_t *perm) {
+int32_t sec__translate_perms(const char *ps, const sec_perm_set_desc *permset, uint32_t *perm) {
     const int32_t count = permset->count > 0 && permset->perms ? permset->count : 0;
     for (const char *c = ps; *c; ++c) {
         int32_t i = 0;
@@ -232,7 +234,7 @@ int32_t sec__translate_perms(const char *ps, sec_perm_set_t permset, uint32_t *p
     return ACL_RC_OK;
 }
 
-int32_t sec__translate_bitmask(uint32_t pbm, sec_perm_set_t permset, char *perm) {
+int32_t sec__translate_bitmask(uint32_t pbm, const sec_perm_set_desc *permset, char *perm) {
     const int32_t count = permset->count > 0 && permset->perms ? permset->count : 0;
     size_t out = 0;  // at most 32 letters: one per bit
     int32_t rc = ACL_RC_OK;

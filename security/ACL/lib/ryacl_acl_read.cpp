@@ -48,7 +48,7 @@ int cache_unusable(const struct stat &acl_st, const struct stat &c) {
 struct reader {
     const char *filename;
     const char *username;
-    sec_perm_set_t permtmpl;
+    const sec_perm_set_desc *permtmpl;
     sec_buffer_t acl;
     uint32_t flags;  // the working copy
     int32_t lineno = 0;

@@ -3,6 +3,7 @@
 #include <langinfo.h>
 #include <pthread.h>
 
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 
@@ -29,11 +30,11 @@ struct source_loc {
 };
 
 // Codeset names forced by tests, per direction (0 to UTF-8, 1 from UTF-8).
-const char *g_codeset_override[2] = {nullptr, nullptr};
+std::atomic<const char *> g_codeset_override[2] = {nullptr, nullptr};
 
 void open_handle(uint32_t flags, zo_iconv_t *handle) {
     char codeset[256] = {};
-    const char *forced = g_codeset_override[(flags & ZO_ICONV_FROM_UTF8) ? 1 : 0];
+    const char *forced = g_codeset_override[(flags & ZO_ICONV_FROM_UTF8) ? 1 : 0].load(std::memory_order_acquire);
     if (forced) {
         std::snprintf(codeset, sizeof codeset, "%s", forced);
     } else if (zo_utf8_is_assumed_1()) {
@@ -79,7 +80,7 @@ void acl__init_to_utf8_handle(void) { open_handle(0, &acl__to_utf8_hdl); }
 void acl__init_from_utf8_handle(void) { open_handle(ZO_ICONV_FROM_UTF8, &acl__from_utf8_hdl); }
 
 void acl__set_codeset_for_test(bool from_utf8, const char *codeset) {
-    g_codeset_override[from_utf8 ? 1 : 0] = codeset;
+    g_codeset_override[from_utf8 ? 1 : 0].store(codeset, std::memory_order_release);
 }
 
 int32_t acl__convert_to_utf8(const char *local_string, size_t *local_length, char **utf8_string,
