@@ -1,10 +1,11 @@
 // The main flows with each allocation failing in turn: 6 and message 89, outputs as documented, no leak.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 
 #include <ctime>
 #include <functional>
 
-#include "../security/ACL/cmd/ryaclfck/aclfck_bulk.cpp"  // -s in process, where the hook reaches
+#include "aclfck.h"  // -s in process, where the hook reaches
 #include "lib_acl_bytes.h"
 #include "ryacl_acl_edit.h"
 #include "ryacl_init.h"

@@ -1,5 +1,5 @@
 // ryaclfck as a process on real files, from golden data; -u with a file in
-// the user's home; and in process, a name replaced after vetting.
+// the user's home; and in process, memory failures.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <pwd.h>
@@ -10,10 +10,8 @@
 #include <regex>
 #include <sstream>
 
-#define main ryaclfck_process_main
-#include "../security/ACL/cmd/ryaclfck/main.cpp"
-#undef main
-#include "../security/ACL/cmd/ryaclfck/aclfck_bulk.cpp"
+#include "aclfck.h"
+#include "ryacl_error.h"
 #include "ryacl_test_support.h"
 
 namespace {
@@ -73,23 +71,6 @@ TEST(CliCheck, UserFileMustBeOwnedByTheUserAndWritableByNoOneElse) {
     EXPECT_TRUE(geteuid() != 0 || chmod(path.c_str(), 0644) != 0 || chown(path.c_str(), 65534, 65534) != 0 ||
                 rytest::run_ryaclfck({"-u", user, "-f", base}, "", {"LC_ALL=C"}).status == 36);  // someone else's
     unlink(path.c_str());
-}
-
-TEST(CliCheck, OpenRefusesANameReplacedAfterVetting) {
-    rytest::tmp_dir d;
-    rytest::write_file(d / "acl", "n r\n");
-    char name[ACL_FNAME_AREA];
-    struct stat vetted;
-    int fd = -1;
-    ASSERT_TRUE(aclfck__get_aclfile((d / "acl").c_str(), nullptr, name, &vetted) == 0 &&
-                open_vetted(name, vetted, &fd) == 0);
-    EXPECT_TRUE((fcntl(fd, F_GETFL) & O_NONBLOCK) == 0 && (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0);
-    close(fd);
-    rytest::write_file(d / "other", "n r\n");
-    ASSERT_EQ(rename((d / "other").c_str(), name), 0);
-    EXPECT_TRUE(open_vetted(name, vetted, &fd) == ACL_RC_BAD_FILE_NAME && rytest::error_msgnum() == 154);
-    ASSERT_TRUE(unlink(name) == 0 && mkfifo(name, 0600) == 0);  // no writer: a blocking open would hang
-    EXPECT_TRUE(open_vetted(name, vetted, &fd) == ACL_RC_BAD_FILE_NAME && fd == -1);
 }
 
 // In process: a memory failure is never a fault of the file, so it ends
