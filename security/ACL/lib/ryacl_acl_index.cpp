@@ -86,7 +86,8 @@ inline head16 head_of(const char *p, size_t len) {
 // `padded`: whole words may be read past the end, as in the copy.
 template <bool padded>
 uint64_t text_hash(const head16 &k, const char *p, size_t len, uint64_t seed) {
-    uint64_t h = mum(k.a ^ seed, k.b ^ kMixA);
+    // Both halves keyed: no chosen text can zero a factor for every seed.
+    uint64_t h = mum(k.a ^ seed, k.b ^ seed ^ kMixA);
     if (len <= 16) return h;
     for (size_t i = 16; i < len; i += 8) {
         uint64_t w = 0;

@@ -353,7 +353,9 @@ int run(options &o, int argc, char **argv) {
     if (rc == 0) rc = sec_convert_acl_to_host(1, &acl);
     if (rc != 0) {
         report_current_error("sec_convert_acl_to_host", rc);
-        sec_release_acl(&acl);
+        // A block whose type byte was damaged is refused by sec_release_acl
+        // but is still ours: the library hands out malloc blocks.
+        if (sec_release_acl(&acl) != 0) std::free(acl.value);
         return RYACL_EXIT_TROUBLE;
     }
 
