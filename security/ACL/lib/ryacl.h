@@ -202,6 +202,38 @@ RYACL_API int32_t sec__group_acles_perm(sec_acl_buffer_t acl, int32_t count, sec
  * service's shutdown step). */
 RYACL_API int32_t acl__trace_unregister_component(void);
 
+/* ---- Indexed evaluation --------------------------------------------------- */
+
+/* A compiled ACL prepared for evaluation by hash lookup: for a service that
+ * evaluates one ACL for many requests.  Opaque; made by sec_create_acl_index,
+ * never changed afterwards (any number of threads may evaluate through one
+ * index at once), released with sec_release_acl_index. */
+typedef struct sec_acl_index_s *sec_acl_index_t;
+
+/* Validate a host-order compiled ACL (the codes and messages of
+ * sec_convert_acl_to_host with verify; a buffer in the other byte order is
+ * refused with ACL_RC_BAD_ACL, message 102) and build its index in *index.
+ * The index keeps a copy: the caller may change or release the buffer
+ * afterwards.  On failure *index is null. */
+RYACL_API int32_t sec_create_acl_index(sec_acl_buffer_t acl, sec_acl_index_t *index);
+
+/* sec__single_acle_perm on the buffer the index was made from: the same
+ * code, mask and recorded error, and the same identity handler calls in the
+ * same order (handlers are looked up at each call, so registrations made
+ * after the index count).  A user lookup without a handler, hit or miss,
+ * costs one hash probe whatever the size of the sub-ACL. */
+RYACL_API int32_t sec_index_single_acle_perm(sec_acl_index_t index, unsigned char type,
+                                             const char *mech, const char *zmech, const char *id,
+                                             uint32_t *perm);
+
+/* sec__group_acles_perm on the buffer the index was made from; one hash
+ * probe per group name. */
+RYACL_API int32_t sec_index_group_acles_perm(sec_acl_index_t index, int32_t count,
+                                             sec_buffer_t groups, uint32_t *perm);
+
+/* Release an index; null is ignored.  Touches no error record. */
+RYACL_API void sec_release_acl_index(sec_acl_index_t index);
+
 #ifdef __cplusplus
 }
 #endif

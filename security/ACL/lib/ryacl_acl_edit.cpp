@@ -364,7 +364,8 @@ int32_t del_entry(sec_acle_t acle, sec_acl_buffer_t acl) {
     if (!where.found)
         return acl::set_error(ACL_RC_NO_MATCH, acl::msg::ACLE_NOT_IN_ACL, e.type, e.mech, e.id ? e.id : "");
     int32_t rc = -1;
-    if (direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed)) rc = direct_del(&e, acl, where.s);
+    if (direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
+        rc = direct_del(&e, acl, where.s);
     if (rc == -1) rc = tree_del(&e, acl, where);
     return rc;
 }

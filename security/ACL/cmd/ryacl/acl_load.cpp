@@ -21,6 +21,7 @@
 #include "ryacl_acl_entry.h"
 #include "ryacl_acl_file.h"
 #include "ryacl_acl_tree.h"
+#include "ryacl_alloc.h"
 #include "ryacl_error.h"
 #include "ryacl_cmd.h"
 
@@ -125,7 +126,7 @@ namespace {
 int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
     out.path = path;
     int fd = open(path, O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK);
-    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, path, errno);
+    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::FILE_OPEN, path, errno);
     int32_t rc = acl__read_acl_file(path, fd, &out.bytes, &out.nbytes);
     close(fd);
     if (rc || !out.bytes) return rc;  // an empty file: no entries
@@ -134,10 +135,10 @@ int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
         return out.add_text(out.bytes, out.nbytes);
     // Only a compiled ACL in this host's byte order is compared: one in the
     // other order was not written here and is refused, not guessed at.
-    if (out.nbytes > INT32_MAX) return acl::set_error(ACL_RC_BAD_ACL, 106, 0, ACL_LOC_ACL);
+    if (out.nbytes > INT32_MAX) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, 0, ACL_LOC_ACL);
     if (out.nbytes < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, static_cast<int32_t>(out.nbytes), ACL_LOC_ACL);
-    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, static_cast<int32_t>(out.nbytes), ACL_LOC_ACL);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     sec_buffer_desc d{static_cast<int32_t>(out.nbytes), out.bytes};
     if ((rc = sec__check_acl_buffer(&d)) != 0) return rc;
     return out.add_compiled(p, out.nbytes);
@@ -161,7 +162,7 @@ bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded
     const size_t n = static_cast<size_t>(buf.length);
     out.bytes = static_cast<char *>(std::malloc(n ? n : 1));
     if (!out.bytes) {
-        acl::set_error(ACL_RC_NO_MEMORY, 89, "ryacl", n);
+        acl__no_memory("ryacl", n);
         print_error();
         return false;
     }

@@ -62,7 +62,7 @@ int32_t report_duplicate(const acl_item &first, const acl_item &dup) {
     // Equal here but not to the trees cannot happen; should it, the file
     // is still refused rather than compared wrongly.
     return rc ? rc
-              : acl::set_error(ACL_RC_BAD_ACLE, 144, acl__type_letter(dup.type), dup.mech,
+              : acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_ACLE, acl__type_letter(dup.type), dup.mech,
                                dup.id ? dup.id : "");
 }
 

@@ -277,19 +277,19 @@ int list_entries(sec_acl_buffer_t acl) {
     return 0;
 }
 
-int evaluate(const options &o, sec_acl_buffer_t acl) {
+int evaluate(const options &o, sec_acl_index_t acl) {
     uint32_t perm = 0;
     int32_t rc = 0;
-    const char *what = "sec__single_acle_perm";
+    const char *what = "sec_index_single_acle_perm";
     switch (o.q) {
     case query::unauthenticated:
-        rc = sec__single_acle_perm(acl, SEC_ACLE_TYPE_UNAUTHENTICATED, nullptr, nullptr, nullptr, &perm);
+        rc = sec_index_single_acle_perm(acl, SEC_ACLE_TYPE_UNAUTHENTICATED, nullptr, nullptr, nullptr, &perm);
         break;
     case query::anyother:
-        rc = sec__single_acle_perm(acl, SEC_ACLE_TYPE_ANYOTHER, nullptr, nullptr, nullptr, &perm);
+        rc = sec_index_single_acle_perm(acl, SEC_ACLE_TYPE_ANYOTHER, nullptr, nullptr, nullptr, &perm);
         break;
     case query::identity:
-        rc = sec__single_acle_perm(acl, SEC_ACLE_TYPE_USER, o.mech.c_str(), nullptr, o.id.c_str(), &perm);
+        rc = sec_index_single_acle_perm(acl, SEC_ACLE_TYPE_USER, o.mech.c_str(), nullptr, o.id.c_str(), &perm);
         break;
     case query::expanded:
         // An empty or over-long mechanism is refused here, with the
@@ -297,19 +297,19 @@ int evaluate(const options &o, sec_acl_buffer_t acl) {
         what = "sec__register_id_handler";
         rc = sec__register_id_handler(SEC_ID_HANDLER_EXPANDED, o.mech.c_str(), expanded_handler);
         if (rc == 0) {
-            what = "sec__single_acle_perm";
-            rc = sec__single_acle_perm(acl, SEC_ACLE_TYPE_EXPANDED, o.mech.c_str(), nullptr, o.id.c_str(),
-                                       &perm);
+            what = "sec_index_single_acle_perm";
+            rc = sec_index_single_acle_perm(acl, SEC_ACLE_TYPE_EXPANDED, o.mech.c_str(), nullptr, o.id.c_str(),
+                                            &perm);
         }
         break;
     case query::groups: {
-        what = "sec__group_acles_perm";
+        what = "sec_index_group_acles_perm";
         std::vector<sec_buffer_desc> groups(o.groups.size());
         for (size_t i = 0; i < groups.size(); ++i) {
             groups[i].length = 0;  // not read: the names are NUL-terminated
             groups[i].value = const_cast<char *>(o.groups[i].c_str());
         }
-        rc = sec__group_acles_perm(acl, static_cast<int32_t>(groups.size()), groups.data(), &perm);
+        rc = sec_index_group_acles_perm(acl, static_cast<int32_t>(groups.size()), groups.data(), &perm);
         break;
     }
     default:
@@ -353,13 +353,26 @@ int run(options &o, int argc, char **argv) {
     if (rc == 0) rc = sec_convert_acl_to_host(1, &acl);
     if (rc != 0) {
         report_current_error("sec_convert_acl_to_host", rc);
-        // sec_release_acl refuses bytes that are not a compiled ACL; they
-        // are still the library's malloc block.
-        std::free(acl.value);
+        // A block whose type byte was damaged is refused by sec_release_acl
+        // but is still ours: the library hands out malloc blocks.
+        if (sec_release_acl(&acl) != 0) std::free(acl.value);
         return RYACL_EXIT_TROUBLE;
     }
 
-    status = o.q == query::list ? list_entries(&acl) : evaluate(o, &acl);
+    if (o.q == query::list) {
+        status = list_entries(&acl);
+    } else {
+        // Evaluated as a service evaluates: through an index of the ACL.
+        sec_acl_index_t index = nullptr;
+        rc = sec_create_acl_index(&acl, &index);
+        if (rc != 0) {
+            report_current_error("sec_create_acl_index", rc);
+            sec_release_acl(&acl);
+            return RYACL_EXIT_TROUBLE;
+        }
+        status = evaluate(o, index);
+        sec_release_acl_index(index);
+    }
     sec_release_acl(&acl);
     return ryacl_util::finish(status);
 }
