@@ -2,11 +2,16 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 
+#include <dlfcn.h>
+#include <pwd.h>
+
 #include <ctime>
 #include <functional>
 
 #include "aclfck.h"  // -s in process, where the hook reaches
 #include "lib_acl_bytes.h"
+#include "ry_zo_int.h"
+#include "ryacl_alloc.h"
 #include "ryacl_acl_edit.h"
 #include "ryacl_init.h"
 #include "ryacl_utils.h"
@@ -178,6 +183,66 @@ TEST(AllocFailures, OutputsStayUntouched) {
     }
     reset();
     sec_release_acle(shown), drop(acl);
+}
+
+// With no memory at all, not even for the copies the report makes, the
+// checker still prints message 89 whole: what the report needs is kept aside.
+TEST(AllocFailures, CheckerReports89WithNoMemoryLeft) {
+    acl_file f;
+    rytest::tmp_dir logs;
+    static long report_asked;
+    report_asked = 0;
+    const int saved = dup(2), log = open((logs / "err").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600);
+    dup2(log, 2);
+    acl__set_alloc_hook([](size_t) { return false; });
+    zo::set_alloc_hook([](size_t) { return ++report_asked, false; });
+    const int32_t rc = aclfck__bulk_aclfile(f.path.c_str(), nullptr, 0);
+    std::fflush(stderr);
+    zo::set_alloc_hook(nullptr);
+    acl__set_alloc_hook(nullptr);
+    dup2(saved, 2), close(saved), close(log);
+    const std::string err = rytest::read_file(logs / "err"), text = acl::msg_text(89);
+    EXPECT_EQ(rc, ACL_RC_NO_MEMORY);
+    EXPECT_GE(report_asked, 2);  // the record's copy and the text's were both refused
+    EXPECT_EQ(err.rfind(text.substr(0, text.find("%1$s")), 0), 0u) << err;
+    EXPECT_NE(err.find("terminating these processes.\n\n"), std::string::npos) << err;
+}
+
+// getpwnam_r in front of the C library's: with a need set, a buffer smaller
+// than that is refused with ERANGE, as for an entry longer than suggested.
+size_t g_pw_need = 0;
+int g_pw_calls = 0;
+
+}  // namespace
+
+extern "C" int getpwnam_r(const char *name, struct passwd *pwd, char *buf, size_t buflen, struct passwd **result) {
+    using lookup = int (*)(const char *, struct passwd *, char *, size_t, struct passwd **);
+    static const auto real = reinterpret_cast<lookup>(dlsym(RTLD_NEXT, "getpwnam_r"));
+    ++g_pw_calls;
+    if (buflen < g_pw_need) {
+        *result = nullptr;
+        return ERANGE;
+    }
+    return real(name, pwd, buf, buflen, result);
+}
+
+namespace {
+
+// A password entry longer than the first buffer is found with a larger one;
+// each allocation failing on the way reports 89.
+TEST(AllocFailures, UserWhoseEntryOutgrowsTheSuggestedBuffer) {
+    long suggested = sysconf(_SC_GETPW_R_SIZE_MAX);
+    g_pw_need = 4 * static_cast<size_t>(suggested > 0 ? suggested : 16384) + 1;  // two doublings past the first
+    uid_t uid = 1;
+    char home[ACL_FNAME_AREA] = {};
+    g_pw_calls = 0;
+    EXPECT_EQ(sec__get_user_info("root", &uid, home), 0) << rytest::error_text();
+    EXPECT_EQ(g_pw_calls, 3);
+    EXPECT_EQ(uid, 0u);
+    EXPECT_STREQ(home, "/root");
+    sweep("sec__get_user_info (entry beyond the first buffer)", [&] { return sec__get_user_info("root", &uid, home); },
+          [&](int32_t rc, long nth) { expect_no_memory(rc, nth, "sec__get_user_info"); });
+    g_pw_need = 0;
 }
 
 int32_t same_id(const char *a, const char *b) { return std::strcmp(a, b); }

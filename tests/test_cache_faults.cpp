@@ -174,6 +174,34 @@ TEST_F(CacheFaults, WriterFailingOrMovedAtEachStepKeepsTheOldCacheAndNoTemporary
     }
 }
 
+// A cache that differs from its ACL file only in a set-user-id, set-group-id
+// or sticky bit is not the file's cache: the reader compiles the text, the
+// writer refuses it with 137 and leaves it alone.
+TEST(CacheMode, SetIdOrStickyBitAloneMakesTheCacheAnother) {
+    rytest::tmp_dir d;
+    const std::string acl = d / "svc.acl", cache = acl + ".cacl";
+    rytest::write_file(acl, "o r\ng staff rw\n", 0640);
+    ASSERT_EQ(rytest::run_ryaclfck({"-s", "-f", acl}).status, 0);
+    struct timespec past[2] = {{time(nullptr) - 100, 0}, {time(nullptr) - 100, 0}};
+    ASSERT_EQ(utimensat(AT_FDCWD, acl.c_str(), past, 0), 0);  // the cache is current
+    auto read_flags = [&] {
+        sec_buffer_desc got{0, nullptr};
+        uint32_t rflags = 0;
+        EXPECT_EQ(sec_read_acl_file(acl.c_str(), nullptr, nullptr, SEC_ACLF_CONVERT_CACHE, &got, &rflags), 0);
+        sec_release_acl(&got);
+        return rflags;
+    };
+    ASSERT_EQ(read_flags(), SEC_ACLF_CONVERT_CACHE);  // the same mode: taken
+    for (mode_t bit : {S_ISUID, S_ISGID, S_ISVTX}) {
+        ASSERT_EQ(chmod(cache.c_str(), 0640 | bit), 0);
+        EXPECT_EQ(read_flags(), SEC_ACLF_FROM_TEXT) << std::oct << bit;
+        const std::string was = fingerprint(cache);
+        EXPECT_EQ(store(acl, "\x85\x01\x02\x00\x00"), ACL_RC_FILE_ERROR) << std::oct << bit;
+        EXPECT_EQ(rytest::error_msgnum(), 137) << std::oct << bit;
+        EXPECT_EQ(fingerprint(cache), was) << std::oct << bit;
+    }
+}
+
 // A reader passes over a cache failing under it for the text, and a store failing above: it stores nothing.
 TEST_F(CacheFaults, ReaderPassesOverEveryFault) {
     ASSERT_EQ(rytest::run_ryaclfck({"-s", "-f", acl}).status, 0);

@@ -163,3 +163,24 @@ TEST_F(HostileFs, NamesSwappedBetweenChecks) {
 }
 
 }  // namespace
+
+namespace {
+
+// A file whose bytes would drive the terminal: its entry type in message
+// 165 and, under -v, its identifiers show control characters as \xNN and
+// everything printable, UTF-8 included, as it is.
+TEST(HostileText, ControlCharactersInAFileNeverReachTheTerminalRaw) {
+    rytest::tmp_dir d;
+    rytest::write_file(d / "bad.acl", "o r\n\x1b[2J r\n");
+    auto r = rytest::run_ryaclfck({"-f", d / "bad.acl"}, "", {"LC_ALL=C.UTF-8", "NLSPATH"});
+    EXPECT_NE(r.err.find("valid\nACLE type (\\x1b[2J)."), std::string::npos) << r.err;
+    EXPECT_EQ(r.err.find('\x1b'), std::string::npos);
+    rytest::write_file(d / "ids.acl", "u unix a\x07\x7f" "b r\ng jos\xc3\xa9\x01 r\n");
+    r = rytest::run_ryaclfck({"-v", "-f", d / "ids.acl"}, "", {"LC_ALL=C.UTF-8", "NLSPATH"});
+    EXPECT_EQ(r.status, 0) << r.err;
+    EXPECT_NE(r.err.find("id = a\\x07\\x7fb;"), std::string::npos) << r.err;
+    EXPECT_NE(r.err.find("id = jos\xc3\xa9\\x01;"), std::string::npos) << r.err;
+    EXPECT_EQ(r.err.find_first_of("\x01\x07\x7f"), std::string::npos);
+}
+
+}  // namespace

@@ -4,7 +4,9 @@
 #include <errno.h>
 #include <gtest/gtest.h>
 #include <nl_types.h>
+#include <unistd.h>
 
+#include <array>
 #include <cstdlib>
 #include <cstring>
 #include <map>
@@ -48,6 +50,8 @@ TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
          "\tFunction name: f\n\tPositional parameter number: \n\tParameter value: 0x\n"},
         // A value of another kind than asked for is shown as its own kind.
         {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 127, tbl[127], 1, &num); }, "routine (42)\n"},
+        {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 91, tbl[91], 3, std::array{one, one, one}.data()); },
+         "\tLine number: f\n\tError code: f\n"},
         {[&] { acl::set_error(105, 153, dir.c_str(), name.c_str()); },
          "Current working directory: " + dir + "\nACL file name: " + name + "\n"},
         {[] { zo_set_error_1(1, nullptr, "none.cat", 1, 9, "100%% of %1$s; %z %1$q %0$s %9999$s end\n", "x"); },
@@ -77,6 +81,104 @@ TEST(ZoError, BuiltInTableAndCompiledCatalogAgree) {
         EXPECT_TRUE(t.empty() || id == (n < 88 ? npos : 0u)) << n;
     }
     catclose(cat);
+}
+
+// Bytes that came from a file never drive a terminal: control characters
+// of text and character arguments show as \xNN, a width counts that form,
+// tab and UTF-8 pass unchanged.
+TEST(ZoError, ControlCharactersInArgumentsAreEscaped) {
+    acl::set_error(43, 165, 3, "\x1b[2J\x7f\tok");
+    EXPECT_NE(rytest::error_text().find("valid\nACLE type (\\x1b[2J\\x7f\tok)."), npos) << rytest::error_text();
+    acl::set_error(43, 161, '\x1b', "jos\xc3\xa9\x01");
+    EXPECT_NE(rytest::error_text().find("ACLE type: \\x1b; ACLE identifier: jos\xc3\xa9\\x01.\n"), npos);
+    zo_set_error_1(1, nullptr, "none.cat", 1, 9, "[%1$-6s][%2$6s][%3$.5s][%4$c]\n", "\x01", "a\x02", "\x03\x04", 'z');
+    EXPECT_EQ(rytest::error_text(), "[\\x01  ][ a\\x02][\\x03][z]\n");
+}
+
+// The library's records (texts referred to, positions scanned once) read
+// back exactly as records made through the public recorder.
+TEST(ZoError, LibraryRecordsReadBackAsPublicOnes) {
+    auto copy = [] {
+        zo_error_t *r = nullptr;
+        zo_get_error_1(&r);
+        std::string s = r ? std::to_string(r->zo_error_id) + "|" + r->zo_msg_cat + "|" + std::to_string(r->zo_msg_set) +
+                                "|" + std::to_string(r->zo_msg_num) + "|" + r->zo_msg_default + "|" + std::to_string(r->zo_arg_cnt)
+                          : "none";
+        for (uint32_t i = 0; r && i < r->zo_arg_cnt; ++i) {
+            const zo_error_arg_t &a = r->zo_args[i];
+            s += "|" + std::to_string(a.zo_arg_type) + ":" +
+                 (a.zo_arg_type == ZO_ERROR_ARG_CHAR_STR ? std::string(a.zo_arg_value.zo_arg_char_str)
+                                                         : std::to_string(a.zo_arg_value.zo_arg_int));
+        }
+        zo_rel_error_1(r);
+        return s + "|" + rytest::error_text();
+    };
+    for (int repeat = 0; repeat < 2; ++repeat) {  // the second meets the scanned positions
+        std::string id = "bob";
+        acl::set_error(43, 134, 0x84, "unix", id.c_str());
+        id = "eve";  // recorded, not referred to
+        const std::string lib = copy();
+        zo_set_error_1(43, nullptr, RYSECLIB_CAT, 1, 134, zo_mesgtbl_ryseclib_msg[134], 0x84, "unix", "bob");
+        EXPECT_EQ(lib, copy());
+        acl::set_error(43, 113, "unit", 7);  // positions 2 and 3 only
+        const std::string skipped = copy();
+        zo_set_error_1(43, nullptr, RYSECLIB_CAT, 1, 113, zo_mesgtbl_ryseclib_msg[113], "unit", 7);
+        EXPECT_EQ(skipped, copy());
+    }
+}
+
+// Out of memory the report still gets through: the record refers to the
+// slot, the default text is formatted into spare storage, and releasing
+// either frees nothing.
+TEST(ZoError, ReportWithoutMemoryFallsBackToTheDefaultText) {
+    acl::set_error(6, 89, "sec_read_acl_file", 4097);
+    const std::string want = rytest::error_text();
+    static long asked;
+    asked = 0;
+    zo::set_alloc_hook([](size_t) { return ++asked, false; });
+    zo_error_t *rec = nullptr;
+    char *text = nullptr;
+    const int got = zo_get_error_1(&rec), formatted = zo_get_errmsg_1(rec, &text);
+    zo::set_alloc_hook(nullptr);
+    EXPECT_EQ(asked, 2);
+    EXPECT_EQ(got, 6);
+    EXPECT_EQ(formatted, 6);
+    ASSERT_TRUE(rec && text);
+    EXPECT_EQ(rec->zo_msg_num, 89);
+    EXPECT_EQ(text, want);
+    EXPECT_EQ(zo_pset_error_1(rec), 0);
+    zo_rel_errmsg_1(text);
+    zo_rel_error_1(rec);
+    EXPECT_EQ(rytest::error_text(), want);
+}
+
+// Installed, the command finds its translation from where it really is,
+// started through PATH or through a link from another directory, and never
+// reads a catalog relative to the directory it runs in.
+TEST(ZoCatalog, InstalledCommandFindsItsTranslationNeverOneBesideTheWorkingDirectory) {
+    rytest::tmp_dir d;
+    const std::string prefix = d / "prefix", cwd = d / "w/x", links = d / "links";
+    auto r = rytest::run({"/usr/bin/env", "cmake", "--install", RYACL_BINARY_DIR, "--prefix", prefix});
+    ASSERT_EQ(r.status, 0) << r.err;
+    auto catalog = [&](const std::string &target, const std::string &text148) {
+        rytest::write_file(d / "t.msg", "$quote \"\n$set 1\n148 \"" + text148 + "\\n\"\n");
+        ASSERT_EQ(rytest::run({"/bin/mkdir", "-p", target.substr(0, target.rfind('/'))}).status, 0);
+        ASSERT_EQ(rytest::run({RYACL_GENCAT, target, d / "t.msg"}).status, 0);
+    };
+    catalog(prefix + "/share/ryacl/nls/C.UTF-8/ryseclib.cat", "4471-162 Echec : l'option -f manque.");
+    for (const char *planted : {"/share/ryacl/ryseclib.cat", "/share/ryacl/nls/C.UTF-8/ryseclib.cat",
+                                "/share/ryacl/nls/C/ryseclib.cat"})
+        catalog(d / "w" + planted, "4471-162 PLANTED");
+    ASSERT_EQ(rytest::run({"/bin/mkdir", "-p", cwd, links}).status, 0);
+    ASSERT_EQ(symlink((prefix + "/bin/ryaclfck").c_str(), (links + "/aclcheck").c_str()), 0);
+    const std::string fr = "4471-162 Echec : l'option -f manque.\n", en = acl::msg_text(148);
+    for (const auto &[dir, cmd] : {std::pair{prefix + "/bin", "ryaclfck"}, std::pair{links, "aclcheck"}})
+        for (const char *locale : {"C.UTF-8", "C"}) {
+            r = rytest::run({"/bin/sh", "-c", std::string(cmd) + " -v"}, cwd,
+                            {"PATH=" + dir + ":/usr/bin:/bin", std::string("LC_ALL=") + locale, "NLSPATH"});
+            EXPECT_EQ(r.status, 4) << cmd;
+            EXPECT_EQ(r.err.rfind(std::string(locale) == "C" ? en : fr, 0), 0u) << cmd << " " << locale << ":\n" << r.err;
+        }
 }
 
 TEST(ZoText, PosixCaseCompareFoldsAsciiOnlyAndNStopsAtN) {

@@ -19,6 +19,15 @@ foreach(t test_acl_parse test_acl_tree test_acl_buffer test_acl_edit test_acl_li
     set_tests_properties(valgrind_${t} PROPERTIES LABELS "valgrind" TIMEOUT 1200)
   endif()
 endforeach()
+# The checker with every trace point on and the entries printed: no trace
+# point may read or record a byte nobody wrote (an output area recorded
+# before it was filled did).
+if(TARGET ryaclfck)
+  add_test(NAME valgrind_ryaclfck_trace_all
+           COMMAND ${_vg} $<TARGET_FILE:ryaclfck> -v -f ${CMAKE_SOURCE_DIR}/examples/service.acl)
+  set_tests_properties(valgrind_ryaclfck_trace_all PROPERTIES LABELS "valgrind" TIMEOUT 600
+    ENVIRONMENT "RYACL_TRACE=all=8;RYACL_TRACE_FILE=${CMAKE_CURRENT_BINARY_DIR}/valgrind_trace.log")
+endif()
 file(GLOB _vg_fuzz CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/fuzz/fuzz_*.cpp)
 foreach(src ${_vg_fuzz})
   get_filename_component(name ${src} NAME_WE)

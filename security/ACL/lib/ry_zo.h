@@ -93,7 +93,10 @@ RY_ZO_API int zo_set_no_error_1(void);
 /*
  * Give the caller its own copy of the current error (release it with
  * zo_rel_error_1), or a null pointer when the slot holds no error.
- * Returns 0, or 6 when the copy cannot be allocated.
+ * Returns 0, or 6 when the copy cannot be allocated: *record is then a
+ * record of the calling thread that refers to the slot itself, valid until
+ * the thread's next error operation, so that an out-of-memory failure can
+ * still be reported.
  */
 RY_ZO_API int zo_get_error_1(zo_error_t **record);
 
@@ -103,8 +106,12 @@ RY_ZO_API int zo_pset_error_1(const zo_error_t *record);
 /*
  * Format a record: the catalog's text for the record's set and number in the
  * current locale, or the default text when the catalog lacks it, with every
- * placeholder replaced.  The text is released with zo_rel_errmsg_1.  Returns
- * 0, 4 for a null record or text pointer, 6 when memory runs out.
+ * placeholder replaced.  Control characters in the arguments (0x00 to 0x1f
+ * but tab, and 0x7f) are written as \xNN.  The text is released with
+ * zo_rel_errmsg_1.  Returns 0, 4 for a null record or text pointer, 6 when
+ * the text cannot be allocated: *text is then the default text formatted
+ * into an area of the calling thread (at most 8 KiB), valid until its next
+ * zo_get_errmsg_1.
  */
 RY_ZO_API int zo_get_errmsg_1(const zo_error_t *record, char **text);
 

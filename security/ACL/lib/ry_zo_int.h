@@ -11,6 +11,8 @@
 #include <string>
 #include <string_view>
 
+#include "ry_zo.h"
+
 // ---- Locale-independent text (POSIX locale case folding) ----------------
 
 // Compare with A-Z folded onto a-z; every other byte compares as an unsigned
@@ -71,6 +73,25 @@ inline int casecmp_len(const char *a, size_t alen, const char *b, size_t blen) {
 inline bool is_control(unsigned char c) { return (c < 0x20 && c != '\t') || c == 0x7f; }
 bool has_controls(std::string_view s);
 std::string escape_controls(std::string_view s);
+
+// Test seam: when set, every copy of a record or message text this layer
+// hands out first asks the hook; false makes that allocation fail.
+void set_alloc_hook(bool (*hook)(size_t n));
+
+// The placeholder positions a default text uses: bit p - 1 of `used` for
+// position p, and the highest one.
+struct arg_positions {
+    uint32_t used;
+    unsigned highest;
+};
+arg_positions scan_arg_positions(const char *text);
+
+// zo_set_error_argv_1 for a catalog name and default text of static storage
+// duration (the library's own table), whose positions the caller scanned
+// once: they are referred to, not copied or parsed again, so recording an
+// error costs little more than copying its arguments.
+void set_error_static(int error_id, const char *msg_cat, int msg_set, int msg_num, const char *msg_default,
+                      arg_positions where, unsigned argc, const zo_error_arg_t *argv);
 
 }  // namespace zo
 

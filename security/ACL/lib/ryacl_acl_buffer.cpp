@@ -122,11 +122,11 @@ int32_t acltrees_size(const acl__trees_s *trees, const char *fname, acl__acl_pla
         if (!size) continue;
         total += size;
         ++nsub;
-        // Past 65535 sub-ACLs or INT32_MAX bytes the layout cannot say what
-        // it holds: refused as an allocation beyond the buffer's own limit
-        // (6, message 89), like an over-long sub-ACL.
-        if (nsub > ACL_MAX_SUBACLS || total > INT32_MAX)
-            return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+        // The header counts sub-ACLs in 16 bits: one more is a limit of
+        // the format, told as such (167).  Past INT32_MAX bytes it is an
+        // allocation beyond the buffer's own limit (6, message 89).
+        if (nsub > ACL_MAX_SUBACLS) return acl::set_error(ACL_RC_BAD_ACL, 167, ACL_MAX_SUBACLS);
+        if (total > INT32_MAX) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
     }
     *plan = {static_cast<size_t>(total), nsub};
     return 0;

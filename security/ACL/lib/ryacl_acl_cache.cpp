@@ -165,6 +165,9 @@ int32_t cache_writer::create_tmp() {
         // no permission, name too long) a longer name will not cure.
         if (errno != EEXIST && errno != EINTR) break;
     }
+    // The report names the temporary file, as the message's text says; its
+    // name is the cache file's plus a dot and hex digits, so it still points
+    // the reader at the directory and the file in question.
     return acl::set_error(ACL_RC_FILE_ERROR, 138, tmpname);
 }
 

@@ -200,12 +200,6 @@ int32_t display_acle_id(sec_acle_t acle, char **mech, char **id) {
     }
 }
 
-// The caller's output area need not hold a text yet: look at it only when
-// the point is recorded, and never past its 33 bytes.
-trace::item output_area(const char *perms) {
-    if (!perms || trace::level(trace::API) < 8) return trace::str(nullptr, "<nil>");
-    return trace::strn(perms, 33);
-}
 
 // A caller may have overwritten the mechanism's NUL; record no more than the
 // field holds.
@@ -312,12 +306,15 @@ int32_t sec_translate_perms(const char *perms, sec_perm_set_t permset, uint32_t 
 
 int32_t sec_translate_bitmask(uint32_t bitmask, sec_perm_set_t permset, char *perms) {
     const void *set_addr = permset;
-    trace::api_entry(97, 99, {trace::val(bitmask), trace::val(set_addr), output_area(perms)});
+    // The caller's area is output only and may be uninitialised: it is
+    // emptied first, so the entry point records the text it holds from then
+    // on and never a byte the caller did not write.
+    if (perms) perms[0] = '\0';
+    trace::api_entry(97, 99, {trace::val(bitmask), trace::val(set_addr), trace::str(perms, "<nil>")});
     int32_t rc = ACL_RC_OK;
     if (!perms) {
         rc = bad_param("sec_translate_mask", 3, perms);
     } else {
-        perms[0] = '\0';
         if (bitmask) rc = sec__translate_bitmask(bitmask, permset ? permset : &acl__default_perm_set, perms);
     }
     if (rc == ACL_RC_OK) trace::api_exit(100, 101, 102, rc, {trace::str(perms)});

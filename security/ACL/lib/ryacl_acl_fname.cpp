@@ -19,6 +19,8 @@ constexpr size_t kMaxPath = ACL_FNAME_AREA - 1;  // characters, without the NUL
 // When the system suggests no size for password lookups, 16 KiB is ample
 // for any entry a password database holds, and small enough to allocate.
 constexpr long kDefaultPwSize = 16384;
+// Growing past this is chasing a broken name service, not a real entry.
+constexpr size_t kMaxPwSize = size_t{1} << 24;
 
 // Append "/" (unless dir already ends with one) and name to the directory
 // held in area (dlen characters).  The caller has checked that it fits.
@@ -36,13 +38,22 @@ int32_t lookup_user(const char *uname, uid_t *uid, char *hdir, const char *fname
     long suggested = static_cast<int32_t>(sysconf(_SC_GETPW_R_SIZE_MAX));
     if (suggested <= 0) suggested = kDefaultPwSize;
     size_t bufsize = 2 * static_cast<size_t>(suggested);
-    char *buf = static_cast<char *>(acl__malloc(bufsize));
-    if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec__get_user_info", bufsize);
-
+    char *buf = nullptr;
     struct passwd pwd;
     struct passwd *found = nullptr;
+    int err;
+    // The suggested size is only a hint: an entry with a long member list or
+    // home directory needs more, and the lookup says so with ERANGE.
+    for (;;) {
+        buf = static_cast<char *>(acl__malloc(bufsize));
+        if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec__get_user_info", bufsize);
+        err = getpwnam_r(uname, &pwd, buf, bufsize, &found);
+        if (err != ERANGE || bufsize >= kMaxPwSize) break;
+        std::free(buf);
+        bufsize *= 2;
+    }
+
     int32_t rc = 0;
-    int err = getpwnam_r(uname, &pwd, buf, bufsize, &found);
     if (err != 0 || !found || std::strncmp(found->pw_name, uname, static_cast<size_t>(suggested)) != 0) {
         rc = acl::set_error(ACL_RC_UNKNOWN_USER, 127, uname);
     } else {

@@ -1,8 +1,10 @@
 // Recording and reporting errors through the default message table.
 #include "ryacl_error.h"
 
+#include <atomic>
 #include <cstdio>
-#include <vector>
+
+#include "ry_zo_int.h"
 
 namespace acl {
 
@@ -11,6 +13,27 @@ const char *msg_text(int32_t msgnum) {
     return zo_mesgtbl_ryseclib_msg[msgnum];
 }
 
+namespace {
+
+// The positions each table text uses, scanned at its first use: 0 not yet,
+// else the used-position bits, the highest position above them and a
+// marker bit.  Racing threads scan alike and store the same value.
+std::atomic<uint32_t> g_positions[RYSECLIB_MSG_COUNT];
+constexpr uint32_t kScanned = 1u << 31;
+
+zo::arg_positions positions_of(int32_t msgnum, const char *text) {
+    if (msgnum < 0 || msgnum >= RYSECLIB_MSG_COUNT) return zo::scan_arg_positions(text);
+    uint32_t v = g_positions[msgnum].load(std::memory_order_relaxed);
+    if (!v) {
+        const zo::arg_positions p = zo::scan_arg_positions(text);
+        v = kScanned | (p.highest << 16) | (p.used & 0xffffu);
+        g_positions[msgnum].store(v, std::memory_order_relaxed);
+    }
+    return {v & 0xffffu, (v >> 16) & 0xffu};
+}
+
+}  // namespace
+
 int32_t set_error_list(int32_t rc, int32_t msgnum, std::initializer_list<err_arg> args) {
     zo_error_arg_t argv[16];
     unsigned n = 0;
@@ -18,7 +41,11 @@ int32_t set_error_list(int32_t rc, int32_t msgnum, std::initializer_list<err_arg
         if (n == 16) break;
         argv[n++] = a.a;
     }
-    zo_set_error_argv_1(rc, nullptr, RYSECLIB_CAT, RYSECLIB_SET, msgnum, msg_text(msgnum), n, argv);
+    // The catalog name and the table's texts live for the process: the
+    // error record refers to them instead of copying a kilobyte of text
+    // for every failure, a miss of an evaluation included.
+    const char *text = msg_text(msgnum);
+    zo::set_error_static(rc, RYSECLIB_CAT, RYSECLIB_SET, msgnum, text, positions_of(msgnum, text), n, argv);
     return rc;
 }
 
