@@ -52,7 +52,9 @@ struct raw_sub {
 };
 
 // True when the bytes are a host-order ACL that follows every rule of
-// validation and whose sub-ACLs fill their lengths and the block exactly.
+// validation: every sub-ACL but the last fills its length exactly; the last
+// one's length may be anything that stays in the block, its entries read up
+// to the block's end, and bytes may follow them.
 bool read_wellformed(const bytes &b, std::vector<raw_sub> &subs) {
     subs.clear();
     const size_t n = b.size();
@@ -62,14 +64,17 @@ bool read_wellformed(const bytes &b, std::vector<raw_sub> &subs) {
     for (unsigned s = 0; s < nsub; ++s) {
         if (n - pos < 10) return false;
         const size_t start = pos, len = ld32(&b[pos]);
-        if (len < 10 || len > n - pos) return false;
+        const bool last = s + 1 == nsub;
+        if ((!last && len < 10) || len > n - pos) return false;
         raw_sub sub{b[pos + 4], "", {}, start};
         const uint32_t count = ld32(&b[pos + 5]);
         const size_t mlen = b[pos + 9];
         const unsigned t = sub.type;
+        const size_t end = last ? n : start + len;
         if (t != 1 && t != 2 && t != 4 && t != 8 && t != 16) return false;
+        if (end - start - 10 < mlen) return false;
         if (has_mech(t)) {
-            if (mlen < 2 || mlen > 17 || len - 10 < mlen) return false;
+            if (mlen < 2 || mlen > 17) return false;
             const char *m = reinterpret_cast<const char *>(&b[pos + 10]);
             if (strnlen(m, mlen) + 1 != mlen) return false;
             sub.mech = m;
@@ -77,7 +82,6 @@ bool read_wellformed(const bytes &b, std::vector<raw_sub> &subs) {
             return false;
         }
         pos += 10 + mlen;
-        const size_t end = start + len;
         for (uint32_t e = 0; e < count; ++e) {
             if (end - pos < 7 || b[pos] != 1) return false;
             const size_t idlen = ld16(&b[pos + 5]);
@@ -87,10 +91,10 @@ bool read_wellformed(const bytes &b, std::vector<raw_sub> &subs) {
             sub.entries.push_back({has_id(t) ? std::string(id) : "", ld32(&b[pos + 1])});
             pos += 7 + idlen;
         }
-        if (pos != end) return false;
+        if (!last && pos != end) return false;
         subs.push_back(sub);
     }
-    return pos == n;
+    return true;
 }
 
 // What listing shows: each sub-ACL read back with a later duplicate's

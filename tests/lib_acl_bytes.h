@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <initializer_list>
+#include <span>
 #include <string>
 #include <utility>
 #include <vector>
@@ -30,6 +31,8 @@ inline uint32_t get(const bytes &b, size_t off, size_t n) {
 // A call's return code with the message number it recorded, compared as one.
 using rc_msg = std::pair<int32_t, int32_t>;
 inline rc_msg with_msg(int32_t rc) { return {rc, rytest::error_msgnum()}; }
+// The same as text: "code/message".
+inline std::string code(int32_t rc) { return std::to_string(rc) + "/" + std::to_string(rytest::error_msgnum()); }
 
 struct ent { uint32_t perm; std::string id; };  // id empty: none (types 1 and 2)
 
@@ -107,6 +110,23 @@ inline bytes view(const sec_buffer_desc &d) {
     return d.length > 0 && p ? bytes(p, p + d.length) : bytes{};
 }
 inline void drop(sec_buffer_desc &d) { std::free(d.value), d = {0, nullptr}; }
+
+using strings = std::vector<std::string>;
+
+// A listing of the descriptor (type < 0: sec_list_acl, else by type):
+// "code/message", then "type:mech:id:perm" per entry.  An empty list has no
+// array; a failure leaves the list as given or empties it.
+inline strings list(sec_buffer_desc &d, int type = -1, const char *mech = nullptr) {
+    sec_acle_list_desc l{-1, reinterpret_cast<sec_acle_t *>(0x1)};
+    const int32_t rc = type < 0 ? sec_list_acl(&d, &l) : sec_list_acl_by_type(&d, static_cast<unsigned char>(type), mech, &l);
+    strings r{code(rc)};
+    if (rc && l.acles == reinterpret_cast<sec_acle_t *>(0x1)) l = {0, nullptr};
+    if ((l.count == 0) != (l.acles == nullptr)) r.push_back("count and array disagree");
+    for (const sec_acle_desc *e : std::span(l.acles, l.acles ? size_t(l.count) : 0))
+        r.push_back(std::to_string(e->type) + ":" + e->mech + ":" + (e->id ? e->id : "-") + ":" + std::to_string(e->perm));
+    sec_release_aclelist(&l);
+    return r;
+}
 
 // Mutants of a valid buffer: every bit flipped, every byte value (every
 // `step`-th) at the offsets given, every truncation.

@@ -13,7 +13,7 @@ std::string edit(sec_buffer_desc &d, const op &o) {
     sec_acle_desc e = entry(o.type, o.perm, o.mech, o.id);
     const int32_t rc = o.kind == '-' ? sec_del_acle_from_acl(&e, &d) : o.kind == '2' ? sec_add_acle_to_acl2(&e, &d)
                                                                                      : sec_add_acle_to_acl(&e, &d);
-    return std::to_string(rc) + "/" + std::to_string(rytest::error_msgnum());
+    return code(rc);
 }
 // The edits in turn on the direct road and the tree road: each gives its code, a failure leaves every byte, and both
 // roads give the same codes and bytes at every step.  The bytes left.

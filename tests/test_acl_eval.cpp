@@ -8,8 +8,6 @@ namespace {
 
 using namespace libtest;
 
-std::string code(int32_t rc) { return std::to_string(rc) + "/" + std::to_string(rytest::error_msgnum()); }
-
 const bytes kAcl = make_acl({subacl(4, "unix", {{1, "alice"}, {2, "bob"}, {4, "carol"}}), subacl(2, "", {{0x10, ""}}),
                              subacl(1, "", {{0x20, ""}}), subacl(16, "", {{1, "adm"}, {4, "staff"}, {8, "wheel"}}),
                              subacl(8, "krb", {{0x200, "x/two"}, {0x100, "x/one"}})});
@@ -18,7 +16,7 @@ const bytes kAcl = make_acl({subacl(4, "unix", {{1, "alice"}, {2, "bob"}, {4, "c
 std::string g_seen;
 int32_t h_cmp(const char *client, const char *entry) {
     g_seen += std::string(entry) + ",";
-    acl::set_error(ACL_RC_INTERNAL, 91, "handler", 1, 2);  // must never reach the caller
+    acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, "handler", 1, 2);  // must never reach the caller
     return std::strcmp(client, entry);
 }
 int32_t h_never(const char *, const char *) { return 1; }

@@ -1,26 +1,14 @@
 // Listing compiled ACLs as entry records, whole or by type.
 #include <gtest/gtest.h>
 
-#include <span>
-
 #include "lib_acl_bytes.h"
 
 namespace {
 
 using namespace libtest;
-using strings = std::vector<std::string>;
-
-// "code/message", then "type:mech:id:perm" per entry; an empty list has no array, a failure leaves it or empties it.
 strings list(const bytes &b, int type = -1, const char *mech = nullptr) {
     sec_buffer_desc d = own(b);
-    sec_acle_list_desc l{-1, reinterpret_cast<sec_acle_t *>(0x1)};
-    const int32_t rc = type < 0 ? sec_list_acl(&d, &l) : sec_list_acl_by_type(&d, static_cast<unsigned char>(type), mech, &l);
-    strings r{std::to_string(rc) + "/" + std::to_string(rc ? rytest::error_msgnum() : 0)};
-    if (rc && l.acles == reinterpret_cast<sec_acle_t *>(0x1)) l = {0, nullptr};
-    EXPECT_EQ(l.count == 0, l.acles == nullptr) << l.count;
-    for (const sec_acle_desc *e : std::span(l.acles, l.acles ? size_t(l.count) : 0))
-        r.push_back(std::to_string(e->type) + ":" + e->mech + ":" + (e->id ? e->id : "-") + ":" + std::to_string(e->perm));
-    sec_release_aclelist(&l);
+    strings r = libtest::list(d, type, mech);
     drop(d);
     return r;
 }

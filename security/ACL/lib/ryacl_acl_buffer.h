@@ -1,6 +1,6 @@
-// The compiled ACL: byte layout helpers, serialising trees, reading
-// sub-ACLs back, finding a sub-ACL.  Multi-byte fields are unaligned and
-// little-endian; they are only ever read and written through these helpers.
+// The compiled ACL: serialising trees, reading sub-ACLs back, finding a
+// sub-ACL.  The layout's constants and field helpers are in the cursor's
+// header.
 #pragma once
 
 #include <cstddef>
@@ -8,34 +8,8 @@
 #include <cstring>
 
 #include "ryacl.h"
+#include "ryacl_acl_cursor.h"
 #include "ryacl_acl_tree.h"
-
-#define ACL_BUF_TYPE 0x85
-#define ACL_BUF_VERSION 1
-#define ACL_BUF_HOST_ORDER 2
-#define ACL_HDR_SIZE 5
-#define ACL_SUBACL_HDR_SIZE 10  // without the mechanism
-#define ACL_ENTRY_HDR_SIZE 7    // without the identifier
-#define ACL_MAX_SUBACLS 65535u
-#define ACL_MAX_IDLEN 65534u    // identifier bytes, its NUL not counted
-
-inline uint16_t acl__load_le16(const unsigned char *p) {
-    return static_cast<uint16_t>(p[0] | (p[1] << 8));
-}
-inline uint32_t acl__load_le32(const unsigned char *p) {
-    return static_cast<uint32_t>(p[0]) | (static_cast<uint32_t>(p[1]) << 8) |
-           (static_cast<uint32_t>(p[2]) << 16) | (static_cast<uint32_t>(p[3]) << 24);
-}
-inline void acl__store_le16(unsigned char *p, uint16_t v) {
-    p[0] = static_cast<unsigned char>(v);
-    p[1] = static_cast<unsigned char>(v >> 8);
-}
-inline void acl__store_le32(unsigned char *p, uint32_t v) {
-    p[0] = static_cast<unsigned char>(v);
-    p[1] = static_cast<unsigned char>(v >> 8);
-    p[2] = static_cast<unsigned char>(v >> 16);
-    p[3] = static_cast<unsigned char>(v >> 24);
-}
 
 // Serialise one tree into a new heap block holding one sub-ACL (*subacl must
 // be null; stays null for a tree without entries).  *sublen receives its
@@ -63,11 +37,16 @@ int32_t acl__acltrees_size(const acl__trees_s *trees, acl__acl_plan *plan);
 // area instead of built whole: a compiled ACL written to a file never needs
 // its full size in memory.  `plan` is that of these trees, unchanged since.
 int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan, const acl__byte_sink *sink);
-// Read the sub-ACL at `subacl` (with `avail` bytes up to the end of the
-// block) back into a new tree; never reads past avail.
-int32_t sec__subacl_to_acltree(const unsigned char *subacl, size_t avail, sec_acltree_t *tree);
+// Read the sub-ACL at `subacl` back into a new tree, its entries located by
+// count and identifier lengths within the `avail` bytes given (its room);
+// its length field is not consulted.  *used (when given) receives the bytes
+// its header and entries take.
+int32_t sec__subacl_to_acltree(const unsigned char *subacl, size_t avail, sec_acltree_t *tree,
+                               size_t *used = nullptr);
 // Point *subacl at the first sub-ACL of type (and, for types 4 and 8,
-// mechanism without regard to case), or null.  Walks only within
-// acl->length.  Always 0.
+// mechanism without regard to case), or null.  Always 0.
 int32_t sec__find_subacl(const sec_acl_buffer_desc *acl, unsigned char type, const char *mech,
                          unsigned char **subacl);
+// The same search, handing back what the cursor knows of the sub-ACL found.
+bool acl__find_subacl(const sec_acl_buffer_desc *acl, unsigned char type, const char *mech,
+                      acl__subacl *found);

@@ -42,10 +42,10 @@ void sec__dump_acle(const sec_acle_desc *acle, sec_perm_set_t ptplset, const cha
         const char letter = acl__type_letter(acle->type);
         switch (acle->type) {
         case SEC_ACLE_TYPE_UNAUTHENTICATED:
-        case SEC_ACLE_TYPE_ANYOTHER: acl::set_error(ACL_RC_INFO, 87, leadspace, letter, perms); break;
+        case SEC_ACLE_TYPE_ANYOTHER: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE, leadspace, letter, perms); break;
         case SEC_ACLE_TYPE_USER:
-        case SEC_ACLE_TYPE_EXPANDED: acl::set_error(ACL_RC_INFO, 85, leadspace, letter, mech, id, perms); break;
-        case SEC_ACLE_TYPE_GROUP: acl::set_error(ACL_RC_INFO, 86, leadspace, letter, id, perms); break;
+        case SEC_ACLE_TYPE_EXPANDED: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE_MECH_ID, leadspace, letter, mech, id, perms); break;
+        case SEC_ACLE_TYPE_GROUP: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE_ID, leadspace, letter, id, perms); break;
         default: break;  // no line of its own: whatever the slot holds is printed
         }
     }
@@ -70,22 +70,22 @@ void sec__dump_subacl(const unsigned char *subacl, size_t avail, const char *lea
     if (!subacl) return;
     if (!leadspace) leadspace = "";
     if (avail < ACL_SUBACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         emit(stdout, false);
         return;
     }
-    const unsigned char type = subacl[4];
+    const acl__subacl s = acl__subacl_alone(subacl, avail);
     // The mechanism shown is bounded by the record's 17-byte field and by
     // the bytes present, whatever the length byte claims.
     char mech[17] = {};
-    if (acl__type_has_mech(type)) {
-        size_t n = subacl[9];
+    if (acl__type_has_mech(s.type)) {
+        size_t n = s.mechlen;
         if (n > avail - ACL_SUBACL_HDR_SIZE) n = avail - ACL_SUBACL_HDR_SIZE;
         if (n > sizeof mech - 1) n = sizeof mech - 1;
         std::memcpy(mech, subacl + ACL_SUBACL_HDR_SIZE, n);
     }
-    acl::set_error(ACL_RC_INFO, 84, leadspace, leadspace, static_cast<int32_t>(acl__load_le32(subacl)),
-                   static_cast<int>(type), mech, static_cast<int32_t>(acl__load_le32(subacl + 5)));
+    acl::set_error(ACL_RC_INFO, acl::msg::DUMP_SUBACL, leadspace, leadspace, static_cast<int32_t>(s.length), static_cast<int>(s.type),
+                   mech, static_cast<int32_t>(s.count));
     emit(stderr, true);
 
     sec_acltree_t tree = nullptr;
@@ -110,22 +110,23 @@ void sec__dump_acl(sec_acl_buffer_t acl) {
     const size_t len = static_cast<size_t>(acl->length);
     // A block too short for the header is no ACL either.
     if (p[0] != ACL_BUF_TYPE || len < ACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_INFO, 82);
+        acl::set_error(ACL_RC_INFO, acl::msg::ACL_NOT_VALID);
         emit(stderr, true);
         return;
     }
-    const unsigned nsub = acl__load_le16(p + 3);
-    acl::set_error(ACL_RC_INFO, 83, acl->length, static_cast<int>(p[1]), static_cast<int>(p[2]),
-                   static_cast<int>(nsub));
+    acl__subacl_cursor<> subs(p, len, acl__walk::lenient);
+    acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACL, acl->length, static_cast<int>(p[1]), static_cast<int>(p[2]),
+                   static_cast<int>(acl__load_le16(p + 3)));
     emit(stderr, false);
-    size_t pos = ACL_HDR_SIZE;
-    for (unsigned k = 0; k < nsub; ++k) {
-        sec__dump_subacl(p + pos, len - pos, "\t");
-        if (len - pos < ACL_SUBACL_HDR_SIZE) break;
-        // A length field of 0 or one running past the end leaves nothing
-        // further that can be located.
-        const size_t sublen = acl__load_le32(p + pos);
-        if (sublen == 0 || sublen > len - pos) break;
-        pos += sublen;
+    // Each sub-ACL is shown with the bytes up to the end of the block, as
+    // its entries are located by their count.  One that cannot be located
+    // (its header or length running past the block, or the length before
+    // it not covering that one's header) ends the dump with message 97.
+    acl__subacl s;
+    int r;
+    while ((r = subs.next(&s)) == 1) sec__dump_subacl(p + s.off, s.avail, "\t");
+    if (r < 0) {
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
+        emit(stdout, false);
     }
 }

@@ -1,8 +1,8 @@
 // Listing a compiled ACL as entry records, whole or by type.
 //
-// The buffer may not have been validated: each sub-ACL visited must cover
-// its header and end inside the block (97 otherwise), and it is read back
-// within its own length.  Sub-ACLs are visited in a loop and each is read
+// The buffer may not have been validated: the sub-ACLs are walked by the
+// cursor, each visited one must hold its header (97 otherwise), and each is
+// read back within its room.  Sub-ACLs are visited in a loop and each is read
 // through a tree that never recurses, so no input makes the stack deep.
 #include <cstdlib>
 #include <cstring>
@@ -27,35 +27,22 @@ int32_t check_acl(const sec_acl_buffer_desc *acl, bool *empty) {
         *empty = true;
         return 0;
     }
-    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     return 0;
 }
 
-// Length of the sub-ACL at `off`, or 0 (97 recorded) when it does not lie
-// inside the block.
-size_t subacl_length(const sec_acl_buffer_desc *acl, size_t off) {
-    const auto *p = static_cast<const unsigned char *>(acl->value);
-    const size_t total = static_cast<size_t>(acl->length);
-    if (off > total || total - off < ACL_SUBACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
-        return 0;
-    }
-    const size_t len = acl__load_le32(p + off);
-    if (len > total - off || len < ACL_SUBACL_HDR_SIZE + size_t{p[off + 9]}) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
-        return 0;
-    }
-    return len;
-}
-
-int32_t expand(const sec_acl_buffer_desc *acl, size_t off, size_t len, sec_acle_list_t list) {
+// Expand one sub-ACL onto the list, read within its room: a sub-ACL that
+// is not the last may not spill into the next.  Its header must lie there
+// too (97 otherwise), for any sub-ACL visited.
+int32_t expand(const unsigned char *base, const acl__subacl &s, sec_acle_list_t list, bool wanted) {
+    if (!s.header_fits()) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
+    if (!wanted) return 0;
     sec_acltree_t tree = nullptr;
-    int32_t rc =
-        sec__subacl_to_acltree(static_cast<const unsigned char *>(acl->value) + off, len, &tree);
+    int32_t rc = sec__subacl_to_acltree(base + s.off, s.room(), &tree);
     if (!rc) rc = sec__acltree_to_aclelist(tree, list);
     sec__free_acltree(tree);
     return rc;
@@ -64,17 +51,12 @@ int32_t expand(const sec_acl_buffer_desc *acl, size_t off, size_t len, sec_acle_
 // Expand every sub-ACL (type 0) or every one of `type`, in buffer order.
 int32_t expand_all(const sec_acl_buffer_desc *acl, unsigned type, sec_acle_list_t list) {
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    const unsigned nsub = acl__load_le16(p + 3);
-    size_t off = ACL_HDR_SIZE;
-    for (unsigned s = 0; s < nsub; ++s) {
-        const size_t len = subacl_length(acl, off);
-        if (!len) return ACL_RC_BAD_ACL;
-        if (type == 0 || p[off + 4] == type) {
-            if (int32_t rc = expand(acl, off, len, list)) return rc;
-        }
-        off += len;
-    }
-    return 0;
+    acl__subacl_cursor<> subs(p, static_cast<size_t>(acl->length));
+    acl__subacl s;
+    int r;
+    while ((r = subs.next(&s)) == 1)
+        if (int32_t rc = expand(p, s, list, type == 0 || s.type == type)) return rc;
+    return r < 0 ? acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL) : 0;
 }
 
 // A list that was being filled is emptied by a failure; a list refused
@@ -92,8 +74,8 @@ int32_t released_on_failure(int32_t rc, sec_acle_list_t list) {
 }
 
 int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 1, 0);
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 2, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 1, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 2, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;
@@ -104,16 +86,16 @@ int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
 
 int32_t list_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
                      sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 1, 0);
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 2, type);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 1, 0);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 2, type);
     const bool has_mech = acl__type_has_mech(type);
     if (has_mech && mech) {
         const size_t mlen = strnlen(mech, 17);
         if (mlen == 0 || mlen > 16)
-            return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 3,
+            return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 3,
                                   static_cast<const void *>(mech));
     }
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 4, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 4, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;
@@ -121,13 +103,9 @@ int32_t list_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
     if (empty) return 0;
     if (has_mech && !mech) return released_on_failure(expand_all(acl, type, list), list);
 
-    unsigned char *sub = nullptr;
-    sec__find_subacl(acl, type, has_mech ? mech : nullptr, &sub);
-    if (!sub) return 0;
-    const size_t off = static_cast<size_t>(sub - static_cast<unsigned char *>(acl->value));
-    const size_t len = subacl_length(acl, off);
-    if (!len) return ACL_RC_BAD_ACL;
-    return released_on_failure(expand(acl, off, len, list), list);
+    acl__subacl s;
+    if (!acl__find_subacl(acl, type, has_mech ? mech : nullptr, &s)) return 0;
+    return released_on_failure(expand(static_cast<const unsigned char *>(acl->value), s, list, true), list);
 }
 
 }  // namespace

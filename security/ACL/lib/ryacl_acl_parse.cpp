@@ -126,7 +126,7 @@ fault missing() { return {ACL_RC_BAD_ACL, 158, nullptr}; }
 fault extra() { return {ACL_RC_BAD_ACL, 159, nullptr}; }
 
 // The permission token, then nothing but a comment.
-fault permissions(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
+fault permissions(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t acle) {
     line_parser::token t = lp.read_token();
     if (sec__translate_perms(t.s, permset, &acle->perm) != ACL_RC_OK)
         return {ACL_RC_PERMISSION, 166, t.s};
@@ -135,7 +135,7 @@ fault permissions(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
 }
 
 // The tokens of one line into acle.
-fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
+fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t acle) {
     if (lp.at_end_mark()) return {};  // blank or comment line
 
     line_parser::token t = lp.read_token();
@@ -170,7 +170,7 @@ fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
 // A text whose length does not end at a NUL would have every scan run off
 // its end; it is refused as corrupted, and consumed whole.
 int32_t refuse_unterminated(char **tacl, size_t *length, int32_t *lineno) {
-    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, 131, *lineno);
+    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED, *lineno);
     *tacl = nullptr;
     *length = 0;
     if (*lineno < INT32_MAX) ++*lineno;
@@ -179,7 +179,7 @@ int32_t refuse_unterminated(char **tacl, size_t *length, int32_t *lineno) {
 
 }  // namespace
 
-int32_t sec__read_acle_from_text(sec_perm_set_t permset, char **tacl, size_t *length,
+int32_t sec__read_acle_from_text(const sec_perm_set_desc *permset, char **tacl, size_t *length,
                                  int32_t *lineno, sec_acle_t acle) {
     std::memset(acle, 0, sizeof *acle);
     char *const start = *tacl;

@@ -95,7 +95,7 @@ const char *inline_bytes(const tree *t) {
 int32_t size_arg(size_t n) { return n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n); }
 
 int32_t no_memory(const char *fname, size_t n) {
-    return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(n));
+    return acl__no_memory(fname, size_arg(n));
 }
 
 bool has_id(unsigned t) { return acl__type_has_id(t); }
@@ -644,9 +644,9 @@ int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
     if (single) {
         switch (ne.type) {
         case SEC_ACLE_TYPE_UNAUTHENTICATED:
-        case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, 160, letter);
-        case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, 161, letter, ne.id);
-        default: return acl::set_error(ACL_RC_BAD_ACLE, 144, letter, ne.mech, ne.id);
+        case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_SINGLE_ACLE, letter);
+        case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_GROUP, letter, ne.id);
+        default: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_ACLE, letter, ne.mech, ne.id);
         }
     }
     stored.perm = ne.perm;
@@ -723,7 +723,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     if (!t) return create(ne, node);
     if (t->type != ne.type || (has_mech(t->type) && (ne.mechlen != t->mechlen ||
                                                      !fold_eq(inline_bytes(t), ne.mech, ne.mechlen))))
-        return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, ne.type);
+        return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, ne.type);
 
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
@@ -889,10 +889,10 @@ void acl__advise_large(void *p, size_t n) {
 // ---- Public operations ------------------------------------------------------------
 
 int32_t sec__add_acle_to_tree(sec_boolean_t single, const sec_acle_desc *acle, sec_acltree_t *node) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__add_acle_to_tree", 2, 0);
-    if (!node) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__add_acle_to_tree", 3, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__add_acle_to_tree", 2, 0);
+    if (!node) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__add_acle_to_tree", 3, 0);
     new_entry ne;
-    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, 103, acle->type);
+    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_TYPE, acle->type);
     return insert(single, ne, node);
 }
 
@@ -926,10 +926,10 @@ int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
 
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
     const char *fname = "sec__add_acle_to_trees";
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 1, 0);
-    if (!trees) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 1, 0);
+    if (!trees) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, 0);
     new_entry ne;
-    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, 103, acle->type);
+    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_TYPE, acle->type);
 
     auto *x = static_cast<trees_index *>(trees->index);
     if (!x) {
@@ -1000,11 +1000,11 @@ void acl__free_trees(acl__trees_s *trees) {
 }
 
 int32_t sec__del_acle_from_tree(const sec_acle_desc *acle, sec_acltree_t t) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__del_acle_from_tree", 1, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__del_acle_from_tree", 1, 0);
     new_entry ne;
     entry_parts(acle, &ne);
     auto not_found = [&] {
-        return acl::set_error(ACL_RC_NO_MATCH, 105, acle->type, has_mech(acle->type) ? ne.mech : "",
+        return acl::set_error(ACL_RC_NO_MATCH, acl::msg::ACLE_NOT_IN_ACL, acle->type, has_mech(acle->type) ? ne.mech : "",
                               has_id(acle->type) ? ne.id : "");
     };
     // The given entry must be of the tree's type; its mechanism is not
@@ -1049,7 +1049,7 @@ void sec__free_acltree(sec_acltree_t t) {
 
 int32_t sec__acltree_to_aclelist(sec_acltree_t t, sec_acle_list_t list) {
     const char *fname = "sec__acltree_to_aclelist";
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, 0);
     const uint32_t n = t ? present_count(t) : 0;
     if (n == 0) return 0;
     // Room for every entry at once: one reallocation per tree, not one per

@@ -2,8 +2,12 @@
 #include "ryacl_alloc.h"
 
 #include <atomic>
+#include <climits>
 #include <cstdlib>
 #include <cstring>
+
+#include "ryacl.h"
+#include "ryacl_error.h"
 
 namespace {
 std::atomic<acl__alloc_hook_t> g_hook{nullptr};
@@ -42,3 +46,14 @@ char *acl__strndup(const char *s, size_t n) {
 }
 
 char *acl__strdup(const char *s) { return acl__strndup(s, SIZE_MAX); }
+
+int32_t acl__no_memory(const char *fn, size_t n) {
+    const int32_t size = n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n);
+    return acl::set_error(ACL_RC_NO_MEMORY, acl::msg::NO_MEMORY, fn, size);
+}
+
+void *acl__malloc_or_record(const char *fn, size_t n) {
+    void *p = acl__malloc(n);
+    if (!p) acl__no_memory(fn, n);
+    return p;
+}

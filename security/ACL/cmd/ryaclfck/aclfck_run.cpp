@@ -45,7 +45,7 @@ struct settings {
 int copy_arg(char **slot, const char *arg) {
     char *copy = acl__strdup(arg);
     if (!copy) {
-        acl::set_error(ACL_RC_NO_MEMORY, 89, "main", std::strlen(arg) + 1);
+        acl__no_memory("main", std::strlen(arg) + 1);
         return RUN_NO_MEMORY;
     }
     *slot = copy;
@@ -75,14 +75,14 @@ int aclfck__main(int argc, char **argv) {
         case 't': slot = &s.ptplname; break;
         case 'u': slot = &s.username; break;
         default:  // '?': unknown letter or missing argument
-            acl::set_error(ACL_RC_BAD_ARGS, 147);
+            acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_OPTION);
             status = RUN_USAGE;
             recorded = true;
             continue;
         }
         if ((bit && (s.flags & bit)) || (slot && *slot)) {
             const char opt[3] = {'-', static_cast<char>(c), '\0'};
-            acl::set_error(ACL_RC_BAD_ARGS, 146, opt);
+            acl::set_error(ACL_RC_BAD_ARGS, acl::msg::OPTION_REPEATED, opt);
             status = RUN_USAGE;
             recorded = true;
             continue;
@@ -99,13 +99,13 @@ int aclfck__main(int argc, char **argv) {
     if (status != RUN_GO) {
         if (!recorded) {
             // -h alone (possibly with other valid options): help, nothing else.
-            acl::set_error(ACL_RC_BAD_ARGS, 81);
+            acl::set_error(ACL_RC_BAD_ARGS, acl::msg::HELP);
             report();
             return 0;
         }
         report();  // only the last recorded error survives
         if (status == RUN_USAGE) {
-            acl::set_error(ACL_RC_BAD_ARGS, 80);
+            acl::set_error(ACL_RC_BAD_ARGS, acl::msg::USAGE);
             report();
             return ACL_RC_BAD_ARGS;
         }
@@ -113,9 +113,9 @@ int aclfck__main(int argc, char **argv) {
     }
 
     if (!s.aclfname) {
-        acl::set_error(ACL_RC_BAD_ARGS, 148);
+        acl::set_error(ACL_RC_BAD_ARGS, acl::msg::NO_FILE_OPTION);
         report();
-        acl::set_error(ACL_RC_BAD_ARGS, 80);
+        acl::set_error(ACL_RC_BAD_ARGS, acl::msg::USAGE);
         report();
         return ACL_RC_BAD_ARGS;
     }
