@@ -47,7 +47,7 @@ struct acl__textfile_opts {
     bool empty_skips_owner = false;  // an empty file is taken before the owner is checked
     bool keep_going = false;         // pass over faulty lines and duplicate entries
     bool each_entry = false;         // hand every entry to the sink
-    sec_perm_set_t permset = nullptr;
+    const sec_perm_set_desc *permset = nullptr;
 };
 
 // Where a parse sends what it meets.  The current error describes a fault

@@ -60,7 +60,7 @@ struct trace_sink final : acl__text_sink {
 struct reader {
     const char *filename;
     const char *username;
-    sec_perm_set_t permtmpl;
+    const sec_perm_set_desc *permtmpl;
     sec_buffer_t acl;
     uint32_t flags;  // the working copy
     int32_t lineno = 0;
@@ -73,7 +73,7 @@ struct reader {
     acl__textfile_opts opts{ACL_RC_FILE_ERROR, 122, 128, 124, true, false,
                             tr::level(tr::INFO) > 7, permtmpl};
 
-    reader(const char *fn, const char *un, sec_perm_set_t pt, sec_buffer_t a, uint32_t f)
+    reader(const char *fn, const char *un, const sec_perm_set_desc *pt, sec_buffer_t a, uint32_t f)
         : filename(fn), username(un), permtmpl(pt), acl(a), flags(f) {}
     int32_t run();
     bool choose_cache();
@@ -227,11 +227,11 @@ int32_t sec_read_acl_file(const char *filename, const char *username, sec_perm_s
     int32_t lineno = 0;
     uint32_t wflags = flags;
     if (!filename) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 1, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 1, 0);
     } else if (!acl) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 5, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 5, 0);
     } else if (username && !*username) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 121);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_USER_NAME);
     } else {
         acl->length = 0;
         acl->value = nullptr;

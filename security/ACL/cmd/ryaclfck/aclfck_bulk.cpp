@@ -56,7 +56,7 @@ int32_t aclfck__check(const char *aclfname, const char *username, uint32_t flags
     acl__parse_result local;
     if (!res) res = &local;
     if (size == 0) {
-        if (flags & ACLFCK_VERBOSE) sink.fault(acl::set_error(ACL_RC_INFO, 157, f.name), 0);
+        if (flags & ACLFCK_VERBOSE) sink.fault(acl::set_error(ACL_RC_INFO, acl::msg::FILE_EMPTY, f.name), 0);
         return 0;  // the cache file is not touched
     }
 
@@ -65,7 +65,7 @@ int32_t aclfck__check(const char *aclfname, const char *username, uint32_t flags
     int32_t result = stopped;
     if (flags & ACLFCK_CACHE) {
         if (stopped != 0 || !res->clean) {
-            sink.fault(acl::set_error(ACL_RC_INFO, 162), 0);
+            sink.fault(acl::set_error(ACL_RC_INFO, acl::msg::CACHE_SKIPPED), 0);
         } else {
             // Streamed: the compiled ACL never needs its whole size in memory.
             rc = acl__cache_acltrees(f.name, &trees, 1);
