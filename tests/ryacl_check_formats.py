@@ -70,7 +70,7 @@ with tempfile.TemporaryDirectory() as top:
     bad = got[1]["diagnostics"]
     expect([(d["line"], d["number"], d["rc"]) for d in bad] == [(2, 179, 42), (3, 174, 43), (4, 172, 42), (6, 157, 43)],
            f"json: bad.acl {[(d['line'], d['number'], d['rc']) for d in bad]}")
-    expect(got[2]["diagnostics"][0]["message"].count("identity: \\xff\x1b.") == 1, "json: bytes of the identity")
+    expect(got[2]["diagnostics"][0]["message"].count("identity: \\xff\\x1b.") == 1, "json: bytes of the identity")
 
     # SARIF: one run, a rule per id used, results pointing at the files.
     raw = run("sarif")

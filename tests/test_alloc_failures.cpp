@@ -9,6 +9,7 @@
 #include <functional>
 
 #include "aclfck.h"  // -s in process, where the hook reaches
+#include "ryacl_error.h"
 #include "lib_acl_bytes.h"
 #include "ry_zo_int.h"
 #include "ryacl_alloc.h"

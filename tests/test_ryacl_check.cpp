@@ -123,7 +123,8 @@ TEST(RyaclCheck, StandardInputAndEscapedControlCharacters) {
     EXPECT_NE(r.out.find("-:2: 4471-157 "), npos) << r.out;
     EXPECT_NE(r.out.find("identity: A\\x1b]0;X\\x07."), npos) << r.out;
     const auto json = ryacl({"check", "--format=json", "acl"}, dir.path());
-    EXPECT_NE(json.out.find("identity: A\\u001b]0;X\\u0007."), npos) << json.out;
+    EXPECT_EQ(json.out.find('\x1b'), npos) << json.out;
+    EXPECT_NE(json.out.find("identity: A\\\\x1b]0;X\\\\x07."), npos) << json.out;  // the text \x1b, JSON-escaped
     const auto empty = rytest::run({"/bin/sh", "-c", std::string(RYACL_CMD_PATH) + " check - < /dev/null"});
     EXPECT_TRUE(empty.status == 0 && empty.out.empty()) << empty.out;
     const auto closed = rytest::run({"/bin/sh", "-c", std::string(RYACL_CMD_PATH) + " check - <&-"});

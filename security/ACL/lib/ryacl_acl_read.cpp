@@ -73,7 +73,7 @@ struct reader {
     acl__textfile_opts opts{ACL_RC_FILE_ERROR, 122, 128, 124, true, false,
                             tr::level(tr::INFO) > 7, permtmpl};
 
-    reader(const char *fn, const char *un, sec_perm_set_t pt, sec_buffer_t a, uint32_t f)
+    reader(const char *fn, const char *un, const sec_perm_set_desc *pt, sec_buffer_t a, uint32_t f)
         : filename(fn), username(un), permtmpl(pt), acl(a), flags(f) {}
     int32_t run();
     bool choose_cache();
