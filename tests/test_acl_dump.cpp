@@ -28,7 +28,7 @@ captured dump(const bytes &b) {
 }
 
 TEST(AclDump, WorkedExampleByteForByte) {
-    acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);  // pending before: cleared by the dump
+    acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);  // pending before: cleared by the dump
     EXPECT_EQ(dump(worked_example()),
               captured("ACL descriptor: 61 byte(s) long\n\tVersion: 1\n\tByte Ordering: 2\n\tNumber of sub-ACLs: 2\n"
                        "\tSubacl:\n\t(length = 39 byte(s); type = 4; mech = unix; ACLE count = 2)\n\n"

@@ -16,7 +16,7 @@ const bytes kAcl = make_acl({subacl(4, "unix", {{1, "alice"}, {2, "bob"}, {4, "c
 std::string g_seen;
 int32_t h_cmp(const char *client, const char *entry) {
     g_seen += std::string(entry) + ",";
-    acl::set_error(ACL_RC_INTERNAL, 91, "handler", 1, 2);  // must never reach the caller
+    acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, "handler", 1, 2);  // must never reach the caller
     return std::strcmp(client, entry);
 }
 int32_t h_never(const char *, const char *) { return 1; }

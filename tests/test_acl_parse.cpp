@@ -1,6 +1,9 @@
 // The ACL text parser: outcomes line by line, limits, messages, and the
 // cursor protocol.  (Random texts: the fuzz target fuzz_acl_text.)
 #include <gtest/gtest.h>
+#include <locale.h>
+
+#include <cctype>
 
 #include "lib_acl_bytes.h"
 #include "ryacl_acl_entry.h"
@@ -79,6 +82,31 @@ TEST(AclParse, LineOutcomesLimitsAndMessages) {
         {"x " + x1094 + x1094 + "\n", "E145@1"},
     };
     for (const auto &c : cases) EXPECT_EQ(words_of(c.text), c.expect) << c.text;
+}
+
+// Every byte separates tokens exactly where the locale's isspace says so,
+// in each locale the parser is used in, set for the process or the thread.
+TEST(AclParse, TokenBytesFollowTheLocale) {
+    auto check_all_bytes = [](const char *where) {
+        for (int b = 1; b < 256; ++b) {
+            if (b == '\n' || b == '\f' || b == '\r' || b == '#') continue;
+            const std::string text = "g a"s + static_cast<char>(b) + "b\n";
+            const std::string expect = std::isspace(b) ? "E166@1(b)" : "g:a"s + static_cast<char>(b) + "b:0";
+            EXPECT_EQ(words_of(text), expect) << where << " byte " << b;
+        }
+    };
+    const std::string saved = setlocale(LC_CTYPE, nullptr);
+    for (const char *name : {"C", "C.UTF-8", "POSIX"}) {
+        if (!setlocale(LC_CTYPE, name)) continue;
+        check_all_bytes(name);
+    }
+    setlocale(LC_CTYPE, saved.c_str());
+    if (locale_t loc = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr)) {
+        locale_t before = uselocale(loc);
+        check_all_bytes("thread C.UTF-8");
+        uselocale(before);
+        freelocale(loc);
+    }
 }
 
 }  // namespace

@@ -96,6 +96,16 @@ TEST(ReadFile, CacheReplacedBetweenLookAndOpen) {
     EXPECT_TRUE(r.rc == "0/0" && r.rflags == SEC_ACLF_FROM_TEXT && r.acl == kCompiled) << r.rc;
 }
 
+// What is not a regular file, or is not there, is refused by the lookup's message (122), not the open's (124).
+TEST(ReadFile, DirectoryFifoAndMissingFileAreLookupFailures) {
+    fixture f;
+    ASSERT_EQ(mkdir((f.dir / "d").c_str(), 0755) | mkfifo((f.dir / "p").c_str(), 0644), 0);
+    for (const char *name : {"d", "p", "missing"}) {
+        for (uint32_t flags : {0u, uint32_t{SEC_ACLF_FROM_TEXT}}) EXPECT_EQ(f.read(flags, f.dir / name).rc, "37/122") << name;
+        EXPECT_NE(rytest::error_text().find("(" + f.dir / name + ")"), std::string::npos) << rytest::error_text();
+    }
+}
+
 // With a user: a simple name in that user's home, owned by the user and writable by no one else.
 TEST(ReadFile, UsersFileMustBeTheirsAndWritableOnlyByThem) {
     const passwd *pw = getpwuid(geteuid());

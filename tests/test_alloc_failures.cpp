@@ -1,4 +1,5 @@
 // The main flows with each allocation failing in turn: 6 and message 89, outputs as documented, no leak.
+#include <fcntl.h>
 #include <gtest/gtest.h>
 
 #include <dlfcn.h>
@@ -7,10 +8,12 @@
 #include <ctime>
 #include <functional>
 
-#include "../security/ACL/cmd/ryaclfck/aclfck_bulk.cpp"  // -s in process, where the hook reaches
+#include "aclfck.h"  // -s in process, where the hook reaches
+#include "ryacl_error.h"
 #include "lib_acl_bytes.h"
 #include "ry_zo_int.h"
 #include "ryacl_alloc.h"
+#include "ryacl_error.h"
 #include "ryacl_acl_edit.h"
 #include "ryacl_init.h"
 #include "ryacl_utils.h"

@@ -1,5 +1,5 @@
 // ryaclfck as a process on real files, from golden data; -u with a file in
-// the user's home; and in process, a name replaced after vetting.
+// the user's home; and in process, memory failures.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <pwd.h>
@@ -10,10 +10,8 @@
 #include <regex>
 #include <sstream>
 
-#define main ryaclfck_process_main
-#include "../security/ACL/cmd/ryaclfck/main.cpp"
-#undef main
-#include "../security/ACL/cmd/ryaclfck/aclfck_bulk.cpp"
+#include "aclfck.h"
+#include "ryacl_error.h"
 #include "ryacl_test_support.h"
 
 namespace {
@@ -21,6 +19,7 @@ namespace {
 // Each directory under tests/golden is one run in a fresh directory and the C locale: args (one a
 // line); input, the file "acl" (absent: none), with its octal mode; stderr, exact but for @PROG@ and
 // @DIR@; status; cacl.hex, the bytes of acl.cacl (absent: nothing but the input may remain).
+using strings = std::vector<std::string>;
 const std::string kGolden = RYACL_SOURCE_DIR "/tests/golden/";
 const size_t npos = std::string::npos;
 
@@ -75,21 +74,25 @@ TEST(CliCheck, UserFileMustBeOwnedByTheUserAndWritableByNoOneElse) {
     unlink(path.c_str());
 }
 
-TEST(CliCheck, OpenRefusesANameReplacedAfterVetting) {
+// A file that is there but cannot be opened (no read permission) is the
+// open's failure, with its errno: 156 for the checker, 124 for the library.
+TEST(CliCheck, AFileThatCannotBeOpenedReportsTheOpensErrno) {
     rytest::tmp_dir d;
-    rytest::write_file(d / "acl", "n r\n");
-    char name[ACL_FNAME_AREA];
-    struct stat vetted;
-    int fd = -1;
-    ASSERT_TRUE(aclfck__get_aclfile((d / "acl").c_str(), nullptr, name, &vetted) == 0 &&
-                open_vetted(name, vetted, &fd) == 0);
-    EXPECT_TRUE((fcntl(fd, F_GETFL) & O_NONBLOCK) == 0 && (fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0);
-    close(fd);
-    rytest::write_file(d / "other", "n r\n");
-    ASSERT_EQ(rename((d / "other").c_str(), name), 0);
-    EXPECT_TRUE(open_vetted(name, vetted, &fd) == ACL_RC_BAD_FILE_NAME && rytest::error_msgnum() == 154);
-    ASSERT_TRUE(unlink(name) == 0 && mkfifo(name, 0600) == 0);  // no writer: a blocking open would hang
-    EXPECT_TRUE(open_vetted(name, vetted, &fd) == ACL_RC_BAD_FILE_NAME && fd == -1);
+    ASSERT_EQ(chmod(d.path().c_str(), 0755), 0);
+    rytest::write_file(d / "acl", "n r\n", 0);
+    // Root reads anything: run as nobody.
+    const strings as = geteuid() == 0 ? strings{"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"}
+                                      : strings{};
+    auto run = [&](strings args) {
+        args.insert(args.begin(), as.begin(), as.end());
+        return rytest::run(args, "", {"LC_ALL=C"});
+    };
+    const auto fck = run({RYACLFCK_PATH, "-f", d / "acl"}), lib = run({RYACL_CMD_PATH, "query", "-n", d / "acl"});
+    const std::string errno_line = "returned by the open() subroutine: " + std::to_string(EACCES) + ".";
+    EXPECT_EQ(fck.status, ACL_RC_FILE_ERROR);
+    EXPECT_TRUE(fck.err.rfind("4471-170 ", 0) == 0 && fck.err.find(errno_line) != npos) << fck.err;
+    EXPECT_EQ(lib.status, 2);
+    EXPECT_TRUE(lib.err.rfind("4471-137 ", 0) == 0 && lib.err.find(errno_line) != npos) << lib.err;
 }
 
 // In process: a memory failure is never a fault of the file, so it ends

@@ -13,6 +13,11 @@
 #include "lib_acl_bytes.h"
 #include "ryacl_acl_file.h"
 
+// The library now reads a huge sparse file it is handed and fails for
+// memory (89), as the checker does: an allocation too large is a failure to
+// report, not a crash, under AddressSanitizer too.
+extern "C" const char *__asan_default_options() { return "allocator_may_return_null=1"; }
+
 namespace {
 
 using strings = std::vector<std::string>;
@@ -127,8 +132,8 @@ TEST_F(HostileFs, NamesSwappedBetweenChecks) {
         EXPECT_TRUE(store(acl) == s.rc && (!s.msg || rytest::error_msgnum() == s.msg) && !g_act) << s.step << s.which;
     }
 
-    // The ACL file swapped between the reader's look and open: none is read.  Named to ryaclfck, a
-    // FIFO or /dev/zero is refused, the sparse file too large, a link followed (root named it).
+    // The ACL file swapped just before the readers open it: what is opened is vetted.  A FIFO or
+    // /dev/zero is refused, the sparse file too large, a link followed (root named it) by both.
     for (const std::string &n : rytest::list_dir(home)) unlink((home + "/" + n).c_str());
     const struct { const char *what; std::function<int()> make; int status; } files[] = {
         {"link to the victim", [&] { return symlink(victim.c_str(), acl.c_str()); }, 0},
@@ -141,7 +146,11 @@ TEST_F(HostileFs, NamesSwappedBetweenChecks) {
         rytest::write_file(acl, text, 0644);
         at_step("read:open", acl, [&](const std::string &) { EXPECT_EQ(unlink(acl.c_str()) | s.make(), 0); });
         const read_result r = read();
-        EXPECT_TRUE(r.rc == ACL_RC_FILE_ERROR && r.msg == 122 && r.acl.empty() && !rytest::file_exists(cache)) << s.what;
+        const int32_t want = s.status == ACL_RC_BAD_FILE_NAME ? ACL_RC_FILE_ERROR : s.status;
+        EXPECT_TRUE(r.rc == want && (!want || r.msg == (want == ACL_RC_FILE_ERROR ? 122 : 89)) &&
+                    r.acl.empty() == (want != 0)) << s.what << r.rc;
+        unlink(cache.c_str());
+        g_act = nullptr;
         const rytest::run_result c = rytest::run({"/usr/bin/timeout", "60", RYACLFCK_PATH, "-s", "-f", acl}, "",
                                                  {"ASAN_OPTIONS=allocator_may_return_null=1"});
         struct stat st {};

@@ -35,7 +35,7 @@ TEST(Threads, EvaluateListReadWhileRegisteringAndCaching) {
     ASSERT_EQ(sec_read_acl_file(file.c_str(), nullptr, nullptr, SEC_ACLF_FROM_TEXT, &acl, nullptr) |
                   sec_translate_perms("w", nullptr, &w) | sec_translate_perms("rw", nullptr, &rw) |
                   sec_translate_perms("a", nullptr, &a), 0);
-    acl::set_error(4, 147);
+    acl::set_error(4, acl::msg::BAD_OPTION);
 
     std::atomic<bool> stop{false};
     std::atomic<int> failures{0};

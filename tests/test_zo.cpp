@@ -37,13 +37,13 @@ TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
     const char *const *tbl = zo_mesgtbl_ryseclib_msg;
     const std::pair<std::function<void()>, std::string> cases[] = {
         // %s %d 0x%x: a pointer-sized value shows its low 32 bits.
-        {[] { acl::set_error(4, 88, "sec_create_acle", 5, 0xdeadbeefu); },
+        {[] { acl::set_error(4, acl::msg::BAD_PARAM, "sec_create_acle", 5, 0xdeadbeefu); },
          "\tFunction name: sec_create_acle\n\tPositional parameter number: 5\n\tParameter value: 0xdeadbeef\n"},
-        {[] { acl::set_error(36, 164, 0x2000); }, "(0x00002000) does not correspond"},       // %08x
-        {[] { acl::set_error(43, 161, 'g', "staff"); }, "ACLE type: g; ACLE identifier: staff.\n"},  // %c
-        {[] { acl::set_error(23, 91, "unit", -1, -2); }, "\tLine number: -1\n\tError code: -2\n"},
+        {[] { acl::set_error(36, acl::msg::BAD_PERM_BIT, 0x2000); }, "(0x00002000) does not correspond"},       // %08x
+        {[] { acl::set_error(43, acl::msg::DUPLICATE_GROUP, 'g', "staff"); }, "ACLE type: g; ACLE identifier: staff.\n"},  // %c
+        {[] { acl::set_error(23, acl::msg::INTERNAL, "unit", -1, -2); }, "\tLine number: -1\n\tError code: -2\n"},
         // 113 and 114 use only positions 2 and 3: the two values land there.
-        {[] { acl::set_error(43, 113, "security/ACL/lib/ryacl_acl", 812); }, "(security/ACL/lib/ryacl_acl:812)\n"},
+        {[] { acl::set_error(43, acl::msg::ACLE_ID_UNEXPECTED, "security/ACL/lib/ryacl_acl", 812); }, "(security/ACL/lib/ryacl_acl:812)\n"},
         {[&] { zo_set_error_1(43, nullptr, "no-such-catalog.cat", 1, 114, tbl[114], "file.c", 7); }, "(file.c:7)\n"},
         // Fewer values than placeholders: the rest format as nothing, nothing more is read.
         {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 88, tbl[88], 1, &one); },
@@ -52,7 +52,7 @@ TEST(ZoError, FormatterPlaceholderKindsPositionsAndMalformedFormats) {
         {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 127, tbl[127], 1, &num); }, "routine (42)\n"},
         {[&] { zo_set_error_argv_1(4, nullptr, "no-such-catalog.cat", 1, 91, tbl[91], 3, std::array{one, one, one}.data()); },
          "\tLine number: f\n\tError code: f\n"},
-        {[&] { acl::set_error(105, 153, dir.c_str(), name.c_str()); },
+        {[&] { acl::set_error(105, acl::msg::CWD_TOO_LONG, dir.c_str(), name.c_str()); },
          "Current working directory: " + dir + "\nACL file name: " + name + "\n"},
         {[] { zo_set_error_1(1, nullptr, "none.cat", 1, 9, "100%% of %1$s; %z %1$q %0$s %9999$s end\n", "x"); },
          "100% of x; %z %1$q %0$s  end\n"},
@@ -87,9 +87,9 @@ TEST(ZoError, BuiltInTableAndCompiledCatalogAgree) {
 // of text and character arguments show as \xNN, a width counts that form,
 // tab and UTF-8 pass unchanged.
 TEST(ZoError, ControlCharactersInArgumentsAreEscaped) {
-    acl::set_error(43, 165, 3, "\x1b[2J\x7f\tok");
+    acl::set_error(43, acl::msg::LINE_BAD_TYPE, 3, "\x1b[2J\x7f\tok");
     EXPECT_NE(rytest::error_text().find("valid\nACLE type (\\x1b[2J\\x7f\tok)."), npos) << rytest::error_text();
-    acl::set_error(43, 161, '\x1b', "jos\xc3\xa9\x01");
+    acl::set_error(43, acl::msg::DUPLICATE_GROUP, '\x1b', "jos\xc3\xa9\x01");
     EXPECT_NE(rytest::error_text().find("ACLE type: \\x1b; ACLE identifier: jos\xc3\xa9\\x01.\n"), npos);
     zo_set_error_1(1, nullptr, "none.cat", 1, 9, "[%1$-6s][%2$6s][%3$.5s][%4$c]\n", "\x01", "a\x02", "\x03\x04", 'z');
     EXPECT_EQ(rytest::error_text(), "[\\x01  ][ a\\x02][\\x03][z]\n");
@@ -115,12 +115,12 @@ TEST(ZoError, LibraryRecordsReadBackAsPublicOnes) {
     };
     for (int repeat = 0; repeat < 2; ++repeat) {  // the second meets the scanned positions
         std::string id = "bob";
-        acl::set_error(43, 134, 0x84, "unix", id.c_str());
+        acl::set_error(43, acl::msg::NO_MATCH, 0x84, "unix", id.c_str());
         id = "eve";  // recorded, not referred to
         const std::string lib = copy();
         zo_set_error_1(43, nullptr, RYSECLIB_CAT, 1, 134, zo_mesgtbl_ryseclib_msg[134], 0x84, "unix", "bob");
         EXPECT_EQ(lib, copy());
-        acl::set_error(43, 113, "unit", 7);  // positions 2 and 3 only
+        acl::set_error(43, acl::msg::ACLE_ID_UNEXPECTED, "unit", 7);  // positions 2 and 3 only
         const std::string skipped = copy();
         zo_set_error_1(43, nullptr, RYSECLIB_CAT, 1, 113, zo_mesgtbl_ryseclib_msg[113], "unit", 7);
         EXPECT_EQ(skipped, copy());
@@ -131,7 +131,7 @@ TEST(ZoError, LibraryRecordsReadBackAsPublicOnes) {
 // slot, the default text is formatted into spare storage, and releasing
 // either frees nothing.
 TEST(ZoError, ReportWithoutMemoryFallsBackToTheDefaultText) {
-    acl::set_error(6, 89, "sec_read_acl_file", 4097);
+    acl::set_error(6, acl::msg::NO_MEMORY, "sec_read_acl_file", 4097);
     const std::string want = rytest::error_text();
     static long asked;
     asked = 0;
@@ -282,7 +282,7 @@ int points() {
 // The first trace point registers: the error slot (full or empty) and errno come out unchanged.
 int slot(bool empty) {
     char file[] = "security/ACL/lib/ryacl_acl";
-    if (!empty) acl::set_error(42, 97, file, 321);
+    if (!empty) acl::set_error(42, acl::msg::ACL_CORRUPTED, file, 321);
     const std::string before = rytest::error_text();
     file[0] = 'X';  // the slot holds its own copy
     errno = EDOM;   // reading the error text may have changed it

@@ -1,17 +1,22 @@
 // msggen: turn the gencat source of the message catalog into the C table of
-// default texts, so that the catalog and the built-in texts never disagree.
+// default texts, so that the catalog and the built-in texts never disagree,
+// and into a header naming every message with the kinds of its arguments.
 //
-//   msggen SOURCE.msg OUTPUT.cpp
+//   msggen SOURCE.msg OUTPUT.cpp OUTPUT.h
 //
 // Understands the subset of the gencat syntax the source uses: "$set N",
 // "$quote C", "$ comment" lines, and "NUMBER TEXT" messages (quoted or not)
 // with the escapes \n \t \v \b \r \f \\ \" and \ooo, continued onto the next
-// line by a trailing backslash.  Only set 1 is taken.
+// line by a trailing backslash.  Only set 1 is taken.  Each message of set 1
+// has a name: a comment line "$ NAME" (upper case, digits, underscores)
+// right above it, which gencat skips like any comment.
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
 #include <iostream>
 #include <map>
+#include <regex>
+#include <set>
 #include <sstream>
 #include <string>
 
@@ -65,6 +70,26 @@ std::string decode(const std::string &raw, char quote, const std::string &file, 
     return out;
 }
 
+// The kinds of a message's arguments, one letter per placeholder position
+// the text uses, in ascending order of position (the order in which callers
+// pass the values; a text may skip a position): 's' for a text ("%N$s"),
+// 'n' for a number ("%N$d", "%N$x", "%N$08x", "%N$c").
+std::string arg_kinds(const std::string &text, const std::string &file, int line) {
+    static const std::regex placeholder(R"(%([0-9]+)\$[0-9]*([a-z]))");
+    std::map<int, char> kinds;
+    for (std::sregex_iterator it(text.begin(), text.end(), placeholder), end; it != end; ++it) {
+        const int pos = std::stoi((*it)[1]);
+        const char conv = (*it)[2].str()[0];
+        const char kind = conv == 's' ? 's' : 'n';
+        if (conv != 's' && conv != 'd' && conv != 'x' && conv != 'c') die(file, line, "unknown conversion");
+        auto [at, fresh] = kinds.emplace(pos, kind);
+        if (!fresh && at->second != kind) die(file, line, "one position used as a text and as a number");
+    }
+    std::string out;
+    for (const auto &[pos, kind] : kinds) out += kind;
+    return out;
+}
+
 std::string c_literal(const std::string &s) {
     std::string out = "\"";
     for (unsigned char c : s) {
@@ -86,11 +111,24 @@ std::string c_literal(const std::string &s) {
     return out + "\"";
 }
 
+// Write only when the content changes, to keep rebuilds quiet.
+bool write_if_changed(const char *path, const std::string &content) {
+    {
+        std::ifstream old(path, std::ios::binary);
+        std::stringstream cur;
+        cur << old.rdbuf();
+        if (old && cur.str() == content) return true;
+    }
+    std::ofstream o(path, std::ios::binary | std::ios::trunc);
+    o << content;
+    return static_cast<bool>(o);
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
-    if (argc != 3) {
-        std::cerr << "usage: msggen SOURCE.msg OUTPUT.cpp\n";
+    if (argc != 4) {
+        std::cerr << "usage: msggen SOURCE.msg OUTPUT.cpp OUTPUT.h\n";
         return 2;
     }
     const std::string file = argv[1];
@@ -98,6 +136,10 @@ int main(int argc, char **argv) {
     if (!in) die(file, 0, "cannot open");
 
     std::map<int, std::string> texts;
+    std::map<int, std::string> names;
+    std::set<std::string> taken;
+    std::string pending_name;  // from a "$ NAME" line, for the next message
+    static const std::regex name_line(R"(\$[ \t]+([A-Z][A-Z0-9_]*)[ \t]*)");
     char quote = 0;
     int set = 0, lineno = 0;
     std::string line;
@@ -118,6 +160,12 @@ int main(int argc, char **argv) {
         }
         if (line.empty()) continue;
         if (line[0] == '$') {
+            std::smatch m;
+            if (std::regex_match(line, m, name_line)) {
+                if (!pending_name.empty()) die(file, first, "two names for one message");
+                pending_name = m[1];
+                continue;
+            }
             std::istringstream ss(line.substr(1));
             std::string kw;
             ss >> kw;
@@ -136,11 +184,17 @@ int main(int argc, char **argv) {
         int num = std::atoi(line.substr(0, i).c_str());
         if (i < line.size() && line[i] != ' ' && line[i] != '\t') die(file, first, "bad separator");
         std::string raw = i < line.size() ? line.substr(i + 1) : "";
+        std::string name;
+        name.swap(pending_name);
         if (set != 1) continue;
         if (num < 0 || num >= kSlots) die(file, first, "message number outside the table");
         if (texts.count(num)) die(file, first, "message number given twice");
+        if (name.empty()) die(file, first, "message without a \"$ NAME\" line above it");
+        if (!taken.insert(name).second) die(file, first, "name " + name + " given twice");
         texts[num] = decode(raw, quote, file, first);
+        names[num] = name + " " + arg_kinds(texts[num], file, first);
     }
+    if (!pending_name.empty()) die(file, lineno, "a name with no message below it");
 
     std::ostringstream out;
     out << "// Generated by msggen from ryseclib_msg.msg.  Do not edit.\n"
@@ -155,15 +209,24 @@ int main(int argc, char **argv) {
     }
     out << "};\n}\n";
 
-    // Write only when the content changes, to keep rebuilds quiet.
-    std::string content = out.str();
-    {
-        std::ifstream old(argv[2], std::ios::binary);
-        std::stringstream cur;
-        cur << old.rdbuf();
-        if (old && cur.str() == content) return 0;
+    std::ostringstream hdr;
+    hdr << "// Generated by msggen from ryseclib_msg.msg.  Do not edit.\n"
+        << "// The messages of the default table by name.  Each constant carries the\n"
+        << "// message's number and the kinds of its arguments, one per placeholder\n"
+        << "// position its text uses ('s' a text, 'n' a number), so that recording a\n"
+        << "// message with the wrong number or kind of arguments does not compile.\n"
+        << "#pragma once\n\n#include <cstdint>\n\nnamespace acl::msg {\n\n"
+        << "template <int32_t Num, char... Kinds>\nstruct id {\n"
+        << "    static constexpr int32_t num = Num;\n"
+        << "    static constexpr unsigned arity = sizeof...(Kinds);\n};\n\n";
+    for (const auto &[num, entry] : names) {
+        const std::string name = entry.substr(0, entry.find(' '));
+        const std::string kinds = entry.substr(entry.find(' ') + 1);
+        hdr << "inline constexpr id<" << num;
+        for (char k : kinds) hdr << ", '" << k << "'";
+        hdr << "> " << name << "{};\n";
     }
-    std::ofstream o(argv[2], std::ios::binary | std::ios::trunc);
-    o << content;
-    return o ? 0 : 1;
+    hdr << "\n}  // namespace acl::msg\n";
+
+    return write_if_changed(argv[2], out.str()) && write_if_changed(argv[3], hdr.str()) ? 0 : 1;
 }

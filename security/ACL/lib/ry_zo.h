@@ -14,12 +14,17 @@
 
 #include <stdint.h>
 
-#if defined(_WIN32)
-#define RY_ZO_API
-#elif defined(RYACL_BUILDING)
-#define RY_ZO_API __attribute__((visibility("default")))
+/*
+ * RYACL_API marks every operation the shared library exports, in this header
+ * and in ryacl.h alike: default visibility while the library itself is built
+ * (everything else in it is hidden), a plain declaration for its clients.
+ */
+#ifndef RYACL_API
+#if defined(RYACL_BUILDING)
+#define RYACL_API __attribute__((visibility("default")))
 #else
-#define RY_ZO_API
+#define RYACL_API
+#endif
 #endif
 
 #ifdef __cplusplus
@@ -75,7 +80,7 @@ typedef struct zo_error_s {
  * `const char *` for "s", an `int` for "d", "x", "08x" and "c".  Texts are
  * copied.  Returns 0.
  */
-RY_ZO_API int zo_set_error_1(int error_id, const char *ffdc_id, const char *msg_cat, int msg_set,
+RYACL_API int zo_set_error_1(int error_id, const char *ffdc_id, const char *msg_cat, int msg_set,
                              int msg_num, const char *msg_default, ...);
 
 /*
@@ -83,12 +88,12 @@ RY_ZO_API int zo_set_error_1(int error_id, const char *ffdc_id, const char *msg_
  * placeholder position that msg_default uses, in ascending order.  Values
  * missing from the array format as nothing; extra ones are ignored.
  */
-RY_ZO_API int zo_set_error_argv_1(int error_id, const char *ffdc_id, const char *msg_cat,
+RYACL_API int zo_set_error_argv_1(int error_id, const char *ffdc_id, const char *msg_cat,
                                   int msg_set, int msg_num, const char *msg_default,
                                   unsigned argc, const zo_error_arg_t *argv);
 
 /* Clear the calling thread's current error. */
-RY_ZO_API int zo_set_no_error_1(void);
+RYACL_API int zo_set_no_error_1(void);
 
 /*
  * Give the caller its own copy of the current error (release it with
@@ -98,10 +103,10 @@ RY_ZO_API int zo_set_no_error_1(void);
  * the thread's next error operation, so that an out-of-memory failure can
  * still be reported.
  */
-RY_ZO_API int zo_get_error_1(zo_error_t **record);
+RYACL_API int zo_get_error_1(zo_error_t **record);
 
 /* Make a copy obtained earlier the current error again; null clears it. */
-RY_ZO_API int zo_pset_error_1(const zo_error_t *record);
+RYACL_API int zo_pset_error_1(const zo_error_t *record);
 
 /*
  * Format a record: the catalog's text for the record's set and number in the
@@ -113,10 +118,10 @@ RY_ZO_API int zo_pset_error_1(const zo_error_t *record);
  * into an area of the calling thread (at most 8 KiB), valid until its next
  * zo_get_errmsg_1.
  */
-RY_ZO_API int zo_get_errmsg_1(const zo_error_t *record, char **text);
+RYACL_API int zo_get_errmsg_1(const zo_error_t *record, char **text);
 
-RY_ZO_API void zo_rel_error_1(zo_error_t *record);
-RY_ZO_API void zo_rel_errmsg_1(char *text);
+RYACL_API void zo_rel_error_1(zo_error_t *record);
+RYACL_API void zo_rel_errmsg_1(char *text);
 
 #ifdef __cplusplus
 }

@@ -240,6 +240,11 @@ std::vector<std::string> image_dirs() {
                 RTLD_DL_LINKMAP) && map && map->l_name && map->l_name[0]) {
         std::string lib = real_dir(map->l_name);
         if (!lib.empty() && lib != exe) dirs.push_back(lib);
+        // A library in a multiarch directory (<prefix>/lib/<triplet>) has
+        // the tree's share/ two levels up: look from <prefix>/lib too.
+        const size_t slash = lib.rfind('/');
+        if (slash != std::string::npos && slash >= 4 && lib.compare(slash - 4, 4, "/lib") == 0)
+            dirs.push_back(lib.substr(0, slash));
     }
     return dirs;
 }

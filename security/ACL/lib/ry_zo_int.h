@@ -67,6 +67,36 @@ inline int casecmp_len(const char *a, size_t alen, const char *b, size_t blen) {
     return 0;
 }
 
+// Equality of n bytes under the same folding, eight at a time.
+inline bool fold_eq(const char *a, const char *b, size_t n) {
+    size_t i = 0;
+    for (; i + 8 <= n; i += 8)
+        if (fold8(load8(a + i)) != fold8(load8(b + i))) return false;
+    for (; i < n; ++i)
+        if (fold(static_cast<unsigned char>(a[i])) != fold(static_cast<unsigned char>(b[i]))) return false;
+    return true;
+}
+
+// A 32-bit hash of n bytes that texts equal under the folding share; the
+// seed keeps apart keys of different kinds (an entry type, say).
+inline uint32_t fold_hash(const char *s, size_t n, uint64_t seed = 0) {
+    uint64_t h = 0x9e3779b97f4a7c15ull ^ seed ^ n;
+    size_t i = 0;
+    for (; i + 8 <= n; i += 8) {
+        h ^= fold8(load8(s + i));
+        h *= 0xff51afd7ed558ccdull;
+        h ^= h >> 29;
+    }
+    uint64_t tail = 0;
+    for (unsigned sh = 0; i < n; ++i, sh += 8) tail |= uint64_t{fold(static_cast<unsigned char>(s[i]))} << sh;
+    h ^= tail;
+    h *= 0xc4ceb9fe1a85ec53ull;
+    h ^= h >> 32;
+    h *= 0xff51afd7ed558ccdull;
+    h ^= h >> 29;
+    return static_cast<uint32_t>(h >> 32);
+}
+
 // Control characters (0x00 to 0x1f but tab, and 0x7f) written as \xNN, so
 // bytes that came from a file never drive the terminal they are shown on.
 // Printable text, UTF-8 included, is unchanged.

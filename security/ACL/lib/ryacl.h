@@ -16,13 +16,7 @@
 
 #include <stdint.h>
 
-#include "ry_zo.h"
-
-#if defined(RYACL_BUILDING)
-#define RYACL_API __attribute__((visibility("default")))
-#else
-#define RYACL_API
-#endif
+#include "ry_zo.h" /* also defines RYACL_API, the export marker */
 
 #ifdef __cplusplus
 extern "C" {
@@ -150,7 +144,9 @@ RYACL_API int32_t sec_create_empty_acl(sec_acl_buffer_t acl);
  * one that already is. */
 RYACL_API int32_t sec_convert_acl_to_host(sec_boolean_t verify, sec_acl_buffer_t acl);
 
-/* Free a compiled ACL and empty its descriptor. */
+/* Free a compiled ACL and empty its descriptor.  A block that is not a
+ * compiled ACL is not freed: ACL_RC_BAD_ACL, and the block stays the
+ * caller's, its descriptor unchanged. */
 RYACL_API int32_t sec_release_acl(sec_acl_buffer_t acl);
 
 /* ---- Editing and listing ----------------------------------------------- */
@@ -176,7 +172,14 @@ RYACL_API int32_t sec_list_acl_by_type(sec_acl_buffer_t acl, unsigned char type,
 /* Release every entry of a list and empty it. */
 RYACL_API void sec_release_aclelist(sec_acle_list_t aclelist);
 
-/* ---- For security services ---------------------------------------------- */
+/* ---- For security services only ------------------------------------------ */
+
+/* The operations below (sec__*, acl__*) are meant for the security services
+ * that guard resources with ACLs, not for general applications: they
+ * evaluate what an ACL grants and change process-wide state (the identity
+ * handler registry, the trace registration).  They are as stable as the
+ * rest of this interface; an application that only reads, edits and lists
+ * ACLs needs none of them. */
 
 /* Register an identity handler for a registry type (SEC_ID_HANDLER_*) and a
  * mechanism of 1 to 16 characters.  Registrations are never removed. */
@@ -195,10 +198,41 @@ RYACL_API int32_t sec__single_acle_perm(sec_acl_buffer_t acl, unsigned char type
 RYACL_API int32_t sec__group_acles_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups,
                                         uint32_t *perm);
 
-/* ---- Trace ----------------------------------------------------------------- */
-
-/* End the library's registration with the trace facility. */
+/* End the library's registration with the trace facility (a security
+ * service's shutdown step). */
 RYACL_API int32_t acl__trace_unregister_component(void);
+
+/* ---- Indexed evaluation --------------------------------------------------- */
+
+/* A compiled ACL prepared for evaluation by hash lookup: for a service that
+ * evaluates one ACL for many requests.  Opaque; made by sec_create_acl_index,
+ * never changed afterwards (any number of threads may evaluate through one
+ * index at once), released with sec_release_acl_index. */
+typedef struct sec_acl_index_s *sec_acl_index_t;
+
+/* Validate a host-order compiled ACL (the codes and messages of
+ * sec_convert_acl_to_host with verify; a buffer in the other byte order is
+ * refused with ACL_RC_BAD_ACL, message 102) and build its index in *index.
+ * The index keeps a copy: the caller may change or release the buffer
+ * afterwards.  On failure *index is null. */
+RYACL_API int32_t sec_create_acl_index(sec_acl_buffer_t acl, sec_acl_index_t *index);
+
+/* sec__single_acle_perm on the buffer the index was made from: the same
+ * code, mask and recorded error, and the same identity handler calls in the
+ * same order (handlers are looked up at each call, so registrations made
+ * after the index count).  A user lookup without a handler, hit or miss,
+ * costs one hash probe whatever the size of the sub-ACL. */
+RYACL_API int32_t sec_index_single_acle_perm(sec_acl_index_t index, unsigned char type,
+                                             const char *mech, const char *zmech, const char *id,
+                                             uint32_t *perm);
+
+/* sec__group_acles_perm on the buffer the index was made from; one hash
+ * probe per group name. */
+RYACL_API int32_t sec_index_group_acles_perm(sec_acl_index_t index, int32_t count,
+                                             sec_buffer_t groups, uint32_t *perm);
+
+/* Release an index; null is ignored.  Touches no error record. */
+RYACL_API void sec_release_acl_index(sec_acl_index_t index);
 
 #ifdef __cplusplus
 }

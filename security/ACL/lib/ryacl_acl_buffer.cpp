@@ -35,12 +35,12 @@ int32_t subacl_size(sec_acltree_s *tree, const char *fname, size_t *size, size_t
     *size = 0;
     if (*count == 0) return 0;
     const unsigned char type = acl__tree_type(tree);
-    if (max_idlen > ACL_MAX_IDLEN) return acl::set_error(ACL_RC_BAD_ACLE, 95);
+    if (max_idlen > ACL_MAX_IDLEN) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
     uint64_t total = ACL_SUBACL_HDR_SIZE;
     if (acl__type_has_mech(type)) total += std::strlen(acl__tree_mech(tree)) + 1;
     total += uint64_t{*count} * ACL_ENTRY_HDR_SIZE;
     if (acl__type_has_id(type)) total += id_bytes + *count;
-    if (total > INT32_MAX) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, INT32_MAX);
+    if (total > INT32_MAX) return acl__no_memory(fname, INT32_MAX);
     *size = static_cast<size_t>(total);
     return 0;
 }
@@ -106,7 +106,7 @@ int32_t write_subacl(sec_acltree_s *tree, writer *w, size_t size, size_t count, 
     }
     if (w->rc) return w->rc;
     // The sizes come from the same entries; a mismatch is a defect here.
-    if (w->overflow || w->written - start != size) return acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    if (w->overflow || w->written - start != size) return acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, 0);
     return 0;
 }
 
@@ -125,8 +125,8 @@ int32_t acltrees_size(const acl__trees_s *trees, const char *fname, acl__acl_pla
         // The header counts sub-ACLs in 16 bits: one more is a limit of
         // the format, told as such (167).  Past INT32_MAX bytes it is an
         // allocation beyond the buffer's own limit (6, message 89).
-        if (nsub > ACL_MAX_SUBACLS) return acl::set_error(ACL_RC_BAD_ACL, 167, ACL_MAX_SUBACLS);
-        if (total > INT32_MAX) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+        if (nsub > ACL_MAX_SUBACLS) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::TOO_MANY_SUBACLS, ACL_MAX_SUBACLS);
+        if (total > INT32_MAX) return acl__no_memory(fname, size_arg(total));
     }
     *plan = {static_cast<size_t>(total), nsub};
     return 0;
@@ -135,7 +135,7 @@ int32_t acltrees_size(const acl__trees_s *trees, const char *fname, acl__acl_pla
 // The buffer header and every non-empty sub-ACL, last slot first.
 int32_t write_acltrees(const acl__trees_s *trees, size_t nsub, writer *w, const char *fname) {
     unsigned char *h = w->take(ACL_HDR_SIZE);
-    if (!h) return w->rc ? w->rc : acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    if (!h) return w->rc ? w->rc : acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, 0);
     h[0] = ACL_BUF_TYPE;
     h[1] = ACL_BUF_VERSION;
     h[2] = ACL_BUF_HOST_ORDER;
@@ -150,21 +150,21 @@ int32_t write_acltrees(const acl__trees_s *trees, size_t nsub, writer *w, const 
 }
 
 int32_t bad_structure(int line) {
-    return acl::set_error(ACL_RC_BAD_ACL, 97, "security/ACL/lib/ryacl_acl", line);
+    return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, "security/ACL/lib/ryacl_acl", line);
 }
 
 }  // namespace
 
 int32_t sec__acltree_to_subacl(sec_acltree_s *tree, unsigned char **subacl, size_t *sublen) {
     const char *fname = "sec__acltree_to_subacl";
-    if (!subacl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!subacl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, 0);
     *subacl = nullptr;
     if (sublen) *sublen = 0;
     size_t size = 0, count = 0;
     if (int32_t rc = subacl_size(tree, fname, &size, &count)) return rc;
     if (size == 0) return 0;
     auto *block = static_cast<unsigned char *>(acl__malloc(size));
-    if (!block) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(size));
+    if (!block) return acl__no_memory(fname, size_arg(size));
     writer w{block, block, size};
     if (int32_t rc = write_subacl(tree, &w, size, count, fname)) {
         std::free(block);
@@ -177,14 +177,14 @@ int32_t sec__acltree_to_subacl(sec_acltree_s *tree, unsigned char **subacl, size
 
 int32_t sec__acltrees_to_acl(const acl__trees_s *trees, sec_acl_buffer_t acl) {
     const char *fname = "sec__acltrees_to_acl";
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, 0);
     acl->length = 0;
     acl->value = nullptr;
     acl__acl_plan plan{};
     if (int32_t rc = acltrees_size(trees, fname, &plan)) return rc;
     const size_t total = plan.total;
     auto *buf = static_cast<unsigned char *>(acl__malloc(total));
-    if (!buf) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(total));
+    if (!buf) return acl__no_memory(fname, size_arg(total));
     acl__advise_large(buf, total);
     writer w{buf, buf, total};
     if (int32_t rc = write_acltrees(trees, plan.nsub, &w, fname)) {
@@ -209,11 +209,11 @@ int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan,
     constexpr size_t kStage = size_t{256} << 10;
     static_assert(kStage >= ACL_ENTRY_HDR_SIZE + ACL_MAX_IDLEN + 1);
     auto *stage = static_cast<unsigned char *>(acl__malloc(kStage));
-    if (!stage) return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(kStage));
+    if (!stage) return acl__no_memory(fname, size_arg(kStage));
     writer w{stage, stage, kStage, sink, kStage};
     int32_t rc = write_acltrees(trees, plan.nsub, &w, fname);
     if (rc == 0) rc = w.flush();
-    if (rc == 0 && w.written != plan.total) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, 0);
+    if (rc == 0 && w.written != plan.total) rc = acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, 0);
     std::free(stage);
     return rc;
 }
@@ -231,25 +231,25 @@ int32_t acl__acltrees_emit(const acl__trees_s *trees, const acl__acl_plan &plan,
 //    text does not end exactly at its length: 43 with message 114.
 // Entry versions are not looked at, as before.
 int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree_t *tree, size_t *used) {
-    if (!tree) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 3, 0);
+    if (!tree) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__subacl_to_acltree", 3, 0);
     *tree = nullptr;
-    if (!p) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__subacl_to_acltree", 1, 0);
+    if (!p) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__subacl_to_acltree", 1, 0);
     if (avail < ACL_SUBACL_HDR_SIZE) return bad_structure(__LINE__);
     const acl__subacl s = acl__subacl_alone(p, avail);
     const unsigned char type = s.type;
     const size_t mechlen = s.mechlen;
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, 107, type, ACL_LOC_ACL);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_TYPE, type, ACL_LOC_ACL);
     if ((type == SEC_ACLE_TYPE_UNAUTHENTICATED || type == SEC_ACLE_TYPE_ANYOTHER) && s.count > 1)
-        return acl::set_error(ACL_RC_BAD_ACL, 98);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::SINGLE_ACLE_REPEATED);
     if (!s.header_fits()) return bad_structure(__LINE__);
     char mech[kMechField] = {};
     const bool with_mech = acl__type_has_mech(type);
     if (with_mech) {
         if (mechlen < 2 || mechlen > kMechField)
-            return acl::set_error(ACL_RC_BAD_ACL, 110, static_cast<int>(mechlen), ACL_LOC_ACL);
+            return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_MECH_LENGTH, static_cast<int>(mechlen), ACL_LOC_ACL);
         std::memcpy(mech, p + ACL_SUBACL_HDR_SIZE, mechlen - 1);
         if (std::strlen(mech) != mechlen - 1 || p[ACL_SUBACL_HDR_SIZE + mechlen - 1] != '\0')
-            return acl::set_error(ACL_RC_BAD_ACL, 111, mech, ACL_LOC_ACL);
+            return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_MECH, mech, ACL_LOC_ACL);
     }
     // Types 1, 2 and 16 carry no mechanism; a length field there is skipped
     // over, as the entries are located after it.
@@ -267,7 +267,7 @@ int32_t sec__subacl_to_acltree(const unsigned char *p, size_t avail, sec_acltree
         }
         const size_t idlen = e.idlen;
         if (with_id && (idlen == 0 || std::memchr(e.id, '\0', idlen) != e.id + idlen - 1)) {
-            rc = acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+            rc = acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_ID_LENGTH, ACL_LOC_ACL);
             break;
         }
         // A sub-ACL holding one identifier twice keeps the later permission.

@@ -106,7 +106,7 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
         int err = errno;
         if (err != ENOENT) {
             tr::point(tr::ERRORS, 109, {tr::str(caclfname), tr::str("stat()"), tr::val(err)});
-            return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+            return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, err);
         }
         tr::point(tr::INFO, 110, {tr::str(caclfname)});
     } else {
@@ -115,11 +115,11 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
         close(pfd);
         if (frc != 0) {
             tr::point(tr::ERRORS, 109, {tr::str(caclfname), tr::str("stat()"), tr::val(err)});
-            return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+            return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, err);
         }
         // A link at the cache name is left alone: rename would replace it,
         // but whoever planted it is up to something.
-        if (S_ISLNK(cst.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
+        if (S_ISLNK(cst.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_OPEN, caclfname);
         exists = true;
     }
 
@@ -127,12 +127,12 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
         if (cst.st_uid != acl_st.st_uid || cst.st_gid != acl_st.st_gid) {
             uint32_t cu = cst.st_uid, cg = cst.st_gid, au = acl_st.st_uid, ag = acl_st.st_gid;
             tr::point(tr::ERRORS, 111, {tr::str(caclfname), tr::val(cu), tr::val(cg), tr::val(au), tr::val(ag)});
-            return acl::set_error(ACL_RC_FILE_ERROR, 136, aclfname);
+            return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_OWNER, aclfname);
         }
         if (cst.st_mode != acl_st.st_mode) {
             uint32_t cm = cst.st_mode & 0xfffu, am = acl_st.st_mode & 0xfffu;
             tr::point(tr::ERRORS, 111, {tr::str(caclfname), tr::val(cm), tr::val(am)});
-            return acl::set_error(ACL_RC_FILE_ERROR, 137, aclfname);
+            return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_MODE, aclfname);
         }
         if (!force && acl_st.st_mtim.tv_sec < cst.st_mtim.tv_sec) return ACL_RC_INFO;
 
@@ -140,7 +140,7 @@ int32_t cache_writer::check_existing(sec_boolean_t force) {
         cachefd = openat(dirfd, caclfname + base, O_WRONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
         struct stat wst {};
         if (cachefd < 0 || fstat(cachefd, &wst) != 0 || wst.st_dev != cst.st_dev || wst.st_ino != cst.st_ino)
-            return acl::set_error(ACL_RC_FILE_ERROR, 138, caclfname);
+            return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_OPEN, caclfname);
     }
     return acl__lock_acl_file(caclfname, cachefd, 2);
 }
@@ -168,7 +168,7 @@ int32_t cache_writer::create_tmp() {
     // The report names the temporary file, as the message's text says; its
     // name is the cache file's plus a dot and hex digits, so it still points
     // the reader at the directory and the file in question.
-    return acl::set_error(ACL_RC_FILE_ERROR, 138, tmpname);
+    return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_OPEN, tmpname);
 }
 
 // Write, then give the file its identity, then make it durable, all on the
@@ -182,7 +182,7 @@ int32_t cache_writer::put(void *ctx, const unsigned char *data, size_t len) {
         ssize_t n = write(w->tmpfd, data + at, len - at);
         if (n < 0 && errno == EINTR) continue;
         // n == 0: no progress and no errno; give up rather than spin.
-        if (n <= 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, w->done, w->src.length, n < 0 ? errno : 0);
+        if (n <= 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_WRITE, w->done, w->src.length, n < 0 ? errno : 0);
         at += static_cast<size_t>(n);
         w->done += static_cast<size_t>(n);
     }
@@ -193,31 +193,31 @@ int32_t cache_writer::fill_tmp() {
     const acl__byte_sink sink{put, this};
     if (int32_t rc = src.produce(src.ctx, &sink)) return rc;
     const size_t len = src.length;
-    if (done != len) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, 0);
+    if (done != len) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_WRITE, done, len, 0);
 
     acl__file_step("cache:fchown", tmpname);
     if (fchown(tmpfd, acl_st.st_uid, acl_st.st_gid) != 0) {
         char uidtext[24];
         std::snprintf(uidtext, sizeof uidtext, "%ju", static_cast<uintmax_t>(acl_st.st_uid));
-        return acl::set_error(ACL_RC_FILE_ERROR, 141, caclfname, uidtext, acl_st.st_gid);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_CHOWN, caclfname, uidtext, acl_st.st_gid);
     }
     // After fchown, which may clear set-id bits.
     acl__file_step("cache:fchmod", tmpname);
     if (fchmod(tmpfd, acl_st.st_mode & 0xfffu) != 0)
-        return acl::set_error(ACL_RC_FILE_ERROR, 142, caclfname, acl_st.st_mode & 0xfffu);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_CHMOD, caclfname, acl_st.st_mode & 0xfffu);
 
     // A failed fsync or close can mean the bytes never reached the disk:
     // reported as a failed write with everything handed over.
     acl__file_step("cache:fsync", tmpname);
-    if (fsync(tmpfd) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, errno);
+    if (fsync(tmpfd) != 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_WRITE, done, len, errno);
     acl__file_step("cache:close", tmpname);
     int crc = close(tmpfd);
     tmpfd = -1;
-    if (crc != 0) return acl::set_error(ACL_RC_FILE_ERROR, 139, done, len, errno);
+    if (crc != 0) return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_WRITE, done, len, errno);
 
     acl__file_step("cache:rename", tmpname);
     if (renameat(dirfd, tmpname + base, dirfd, caclfname + base) != 0)
-        return acl::set_error(ACL_RC_FILE_ERROR, 163, tmpname, caclfname);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::CACHE_RENAME, tmpname, caclfname);
     tmp_created = false;
     return 0;
 }
@@ -240,7 +240,7 @@ int32_t store(const char *aclfname, const cache_source &src, sec_boolean_t force
     if (nlen > ACL_CACHE_MAX_ACLFNAME) {
         uint32_t len32 = static_cast<uint32_t>(nlen);
         tr::point(tr::ERRORS, 108, {tr::str(aclfname), tr::val(len32)});
-        return acl::set_error(ACL_RC_FILE_ERROR, 135, aclfname);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::FILE_NAME_TOO_LONG, aclfname);
     }
 
     cache_writer w{};
@@ -270,7 +270,7 @@ int32_t store(const char *aclfname, const cache_source &src, sec_boolean_t force
     }
     if (w.dirfd < 0 || err) {
         tr::point(tr::ERRORS, 109, {tr::str(aclfname), tr::str("stat()"), tr::val(err)});
-        rc = acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
+        rc = acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, aclfname, err);
     }
 
     if (rc == 0) rc = w.check_existing(force);
@@ -298,19 +298,19 @@ int32_t put_trees(const void *ctx, const acl__byte_sink *sink) {
 }  // namespace
 
 int32_t sec__cache_aclbuffer(const char *aclfname, const sec_acl_buffer_desc *acl, sec_boolean_t force) {
-    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 1, 0);
+    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__cache_aclbuffer", 1, 0);
     // An absent descriptor holds no ACL, like an empty one.
     if (!acl || acl->length == 0) {
         if (tr::level(tr::INFO) == 1) tr::record_data(107, {tr::str(aclfname)});
         return ACL_RC_INFO;
     }
     if (acl->length < 0 || !acl->value)
-        return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__cache_aclbuffer", 2, acl);
+        return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__cache_aclbuffer", 2, acl);
     return store(aclfname, {static_cast<size_t>(acl->length), put_buffer, acl}, force);
 }
 
 int32_t acl__cache_acltrees(const char *aclfname, const acl__trees_s *trees, sec_boolean_t force) {
-    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__cache_acltrees", 1, 0);
+    if (!aclfname) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__cache_acltrees", 1, 0);
     // Refusals of the trees come before any file is looked at, as when the
     // compiled ACL is built first.
     planned_trees p{trees, {}};

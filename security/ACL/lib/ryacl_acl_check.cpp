@@ -22,18 +22,18 @@ namespace {
 using acl::trace::str;
 using acl::trace::val;
 
-int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, 97, "security/ACL/lib/ryacl_acl", line); }
+int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, "security/ACL/lib/ryacl_acl", line); }
 
 // The rules of one sub-ACL's header: 0, or 42 with its message.
 int32_t check_subacl(const unsigned char *p, size_t len, const acl__subacl &s) {
     const unsigned type = s.type, mlen = s.mechlen;
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, 107, type, ACL_LOC_ACL);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_TYPE, type, ACL_LOC_ACL);
     if (!acl__type_has_mech(type)) {
-        if (mlen != 0) return acl::set_error(ACL_RC_BAD_ACL, 108, type, ACL_LOC_ACL);
-        if (!acl__type_has_id(type) && s.count > 1) return acl::set_error(ACL_RC_BAD_ACL, 109, ACL_LOC_ACL);
+        if (mlen != 0) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::SUBACL_TYPE_WITH_MECH, type, ACL_LOC_ACL);
+        if (!acl__type_has_id(type) && s.count > 1) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::SUBACL_SINGLE_REPEATED, ACL_LOC_ACL);
         return 0;
     }
-    if (mlen < 2 || mlen > 17) return acl::set_error(ACL_RC_BAD_ACL, 110, mlen, ACL_LOC_ACL);
+    if (mlen < 2 || mlen > 17) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_MECH_LENGTH, mlen, ACL_LOC_ACL);
     if (!acl__fits(s.off + ACL_SUBACL_HDR_SIZE, mlen, len)) return corrupted(__LINE__);
     const char *m = reinterpret_cast<const char *>(p + s.off + ACL_SUBACL_HDR_SIZE);
     if (strnlen(m, mlen) + 1 != mlen) {
@@ -41,7 +41,7 @@ int32_t check_subacl(const unsigned char *p, size_t len, const acl__subacl &s) {
         char shown[18];
         std::memcpy(shown, m, mlen);
         shown[mlen] = '\0';
-        return acl::set_error(ACL_RC_BAD_ACL, 111, shown, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_SUBACL_MECH, shown, ACL_LOC_ACL);
     }
     return 0;
 }
@@ -49,10 +49,10 @@ int32_t check_subacl(const unsigned char *p, size_t len, const acl__subacl &s) {
 // The rules of one entry: 0; 43 with its message for a fault that ends the
 // sub-ACL's entries; 42 (97) for an identifier cut off by the block's end.
 int32_t check_entry(const acl__subacl &s, const acl__entry &e) {
-    if (e.version != 1) return acl::set_error(ACL_RC_BAD_ACLE, 112, e.version, ACL_LOC_ACL);
-    if (!acl__type_has_id(s.type)) return e.idlen != 0 ? acl::set_error(ACL_RC_BAD_ACLE, 113, ACL_LOC_ACL) : 0;
+    if (e.version != 1) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_VERSION, e.version, ACL_LOC_ACL);
+    if (!acl__type_has_id(s.type)) return e.idlen != 0 ? acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_ID_UNEXPECTED, ACL_LOC_ACL) : 0;
     if (!e.id) return corrupted(__LINE__);
-    if (e.idlen == 0 || strnlen(e.id, e.idlen) + 1 != e.idlen) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+    if (e.idlen == 0 || strnlen(e.id, e.idlen) + 1 != e.idlen) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_ID_LENGTH, ACL_LOC_ACL);
     return 0;
 }
 
@@ -93,7 +93,7 @@ int32_t walk(typename Read::byte *p, size_t len) {
 
 int32_t sec__check_acl_buffer(const sec_acl_buffer_desc *acl) {
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     return walk<acl__read_host, true>(static_cast<const unsigned char *>(acl->value),
                                       static_cast<size_t>(acl->length));
 }
@@ -106,15 +106,15 @@ int32_t sec_convert_acl_to_host(sec_boolean_t verify, sec_acl_buffer_t acl) {
     int32_t rc = 0;
     auto *p = acl ? static_cast<unsigned char *>(acl->value) : nullptr;
     if (!acl) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_convert_acl_to_host", 1, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_convert_acl_to_host", 1, 0);
     } else if (acl->length <= 0 || !p) {
-        rc = acl::set_error(ACL_RC_BAD_ACL, 96);
+        rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     } else if (acl->length < ACL_HDR_SIZE) {
         // Bytes 0 to 4 are the header; a shorter block cannot be walked or
         // reversed, whatever `verify` says.
-        rc = acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     } else if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) {
-        rc = acl::set_error(ACL_RC_BAD_ACL, 96);
+        rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     } else if (p[2] == ACL_BUF_HOST_ORDER) {
         acl::trace::point(acl::trace::INFO, 104, {});
         if (verify) rc = sec__check_acl_buffer(acl);
@@ -133,15 +133,15 @@ int32_t sec_read_acl_from_data(int32_t length, const unsigned char *buffer, sec_
     acl::clear_error();
     int32_t rc = 0;
     if (length < 1) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_from_data", 1, length);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_from_data", 1, length);
     } else if (!buffer) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_from_data", 2, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_from_data", 2, 0);
     } else if (!acl) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_from_data", 3, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_from_data", 3, 0);
     } else {
         void *copy = acl__malloc(static_cast<size_t>(length));
         if (!copy) {
-            rc = acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_read_acl_from_data", length);
+            rc = acl__no_memory("sec_read_acl_from_data", length);
         } else {
             std::memcpy(copy, buffer, static_cast<size_t>(length));
             acl->length = length;
@@ -153,10 +153,10 @@ int32_t sec_read_acl_from_data(int32_t length, const unsigned char *buffer, sec_
 }
 
 int32_t sec_create_empty_acl(sec_acl_buffer_t acl) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_create_empty_acl", 1, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_create_empty_acl", 1, 0);
     auto *p = static_cast<unsigned char *>(acl__malloc(ACL_HDR_SIZE));
     acl->value = p;
-    if (!p) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_create_empty_acl", ACL_HDR_SIZE);
+    if (!p) return acl__no_memory("sec_create_empty_acl", ACL_HDR_SIZE);
     acl->length = ACL_HDR_SIZE;
     p[0] = ACL_BUF_TYPE;
     p[1] = ACL_BUF_VERSION;
@@ -176,7 +176,7 @@ int32_t sec_release_acl(sec_acl_buffer_t acl) {
         // whatever the length says.  A length without a block is not read
         // through.
         if (!p || p[0] != ACL_BUF_TYPE) {
-            rc = acl::set_error(ACL_RC_BAD_ACL, 93);
+            rc = acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_ACL);
         } else {
             std::free(acl->value);
             acl->value = nullptr;

@@ -42,10 +42,10 @@ void sec__dump_acle(const sec_acle_desc *acle, sec_perm_set_t ptplset, const cha
         const char letter = acl__type_letter(acle->type);
         switch (acle->type) {
         case SEC_ACLE_TYPE_UNAUTHENTICATED:
-        case SEC_ACLE_TYPE_ANYOTHER: acl::set_error(ACL_RC_INFO, 87, leadspace, letter, perms); break;
+        case SEC_ACLE_TYPE_ANYOTHER: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE, leadspace, letter, perms); break;
         case SEC_ACLE_TYPE_USER:
-        case SEC_ACLE_TYPE_EXPANDED: acl::set_error(ACL_RC_INFO, 85, leadspace, letter, mech, id, perms); break;
-        case SEC_ACLE_TYPE_GROUP: acl::set_error(ACL_RC_INFO, 86, leadspace, letter, id, perms); break;
+        case SEC_ACLE_TYPE_EXPANDED: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE_MECH_ID, leadspace, letter, mech, id, perms); break;
+        case SEC_ACLE_TYPE_GROUP: acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACLE_ID, leadspace, letter, id, perms); break;
         default: break;  // no line of its own: whatever the slot holds is printed
         }
     }
@@ -70,7 +70,7 @@ void sec__dump_subacl(const unsigned char *subacl, size_t avail, const char *lea
     if (!subacl) return;
     if (!leadspace) leadspace = "";
     if (avail < ACL_SUBACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         emit(stdout, false);
         return;
     }
@@ -84,7 +84,7 @@ void sec__dump_subacl(const unsigned char *subacl, size_t avail, const char *lea
         if (n > sizeof mech - 1) n = sizeof mech - 1;
         std::memcpy(mech, subacl + ACL_SUBACL_HDR_SIZE, n);
     }
-    acl::set_error(ACL_RC_INFO, 84, leadspace, leadspace, static_cast<int32_t>(s.length), static_cast<int>(s.type),
+    acl::set_error(ACL_RC_INFO, acl::msg::DUMP_SUBACL, leadspace, leadspace, static_cast<int32_t>(s.length), static_cast<int>(s.type),
                    mech, static_cast<int32_t>(s.count));
     emit(stderr, true);
 
@@ -110,12 +110,12 @@ void sec__dump_acl(sec_acl_buffer_t acl) {
     const size_t len = static_cast<size_t>(acl->length);
     // A block too short for the header is no ACL either.
     if (p[0] != ACL_BUF_TYPE || len < ACL_HDR_SIZE) {
-        acl::set_error(ACL_RC_INFO, 82);
+        acl::set_error(ACL_RC_INFO, acl::msg::ACL_NOT_VALID);
         emit(stderr, true);
         return;
     }
     acl__subacl_cursor<> subs(p, len, acl__walk::lenient);
-    acl::set_error(ACL_RC_INFO, 83, acl->length, static_cast<int>(p[1]), static_cast<int>(p[2]),
+    acl::set_error(ACL_RC_INFO, acl::msg::DUMP_ACL, acl->length, static_cast<int>(p[1]), static_cast<int>(p[2]),
                    static_cast<int>(acl__load_le16(p + 3)));
     emit(stderr, false);
     // Each sub-ACL is shown with the bytes up to the end of the block, as
@@ -126,7 +126,7 @@ void sec__dump_acl(sec_acl_buffer_t acl) {
     int r;
     while ((r = subs.next(&s)) == 1) sec__dump_subacl(p + s.off, s.avail, "\t");
     if (r < 0) {
-        acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+        acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
         emit(stdout, false);
     }
 }

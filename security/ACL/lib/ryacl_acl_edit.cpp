@@ -24,7 +24,7 @@
 #include "ryacl_error.h"
 #include "ryacl_trace.h"
 
-bool acl__edit_direct_enabled = true;
+std::atomic<bool> acl__edit_direct_enabled{true};
 
 namespace {
 
@@ -40,17 +40,17 @@ constexpr size_t kMaxLength = INT32_MAX;
 int32_t take_entry(const sec_acle_desc *acle, sec_acle_desc *e) {
     std::memset(e, 0, sizeof *e);
     const unsigned type = acle->type;
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACLE, 103, type);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_TYPE, type);
     e->type = acle->type;
     e->perm = acle->perm;
     if (acl__type_has_mech(type)) {
         // An unterminated mechanism field is no mechanism.
         size_t mlen = strnlen(acle->mech, sizeof acle->mech);
         if (mlen == 0 || mlen == sizeof acle->mech || !acle->id)
-            return acl::set_error(ACL_RC_BAD_ACLE, 104, type);
+            return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_TYPE_NEEDS_MECH_OR_ID, type);
         std::memcpy(e->mech, acle->mech, mlen);
     }
-    if (type == SEC_ACLE_TYPE_GROUP && !acle->id) return acl::set_error(ACL_RC_BAD_ACLE, 104, type);
+    if (type == SEC_ACLE_TYPE_GROUP && !acle->id) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_TYPE_NEEDS_MECH_OR_ID, type);
     if (acl__type_has_id(type)) e->id = acle->id;
     return 0;
 }
@@ -58,13 +58,13 @@ int32_t take_entry(const sec_acle_desc *acle, sec_acle_desc *e) {
 // Header checks of an existing buffer.  A block shorter than the header is
 // not read.
 int32_t check_header(const sec_acl_buffer_desc *acl) {
-    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 93);
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_ACL);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (p[0] != ACL_BUF_TYPE) return acl::set_error(ACL_RC_BAD_ACL, 100);
-    if (p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 101);
-    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+    if (p[0] != ACL_BUF_TYPE) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BUFFER_TYPE);
+    if (p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BUFFER_VERSION);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     return 0;
 }
 
@@ -77,7 +77,7 @@ struct located {
 int32_t locate(const sec_acl_buffer_desc *acl, const sec_acle_desc *e, located *where) {
     *where = located{};
     where->found = acl__find_subacl(acl, e->type, e->mech, &where->s);
-    if (where->found && !where->s.header_fits()) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+    if (where->found && !where->s.header_fits()) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     return 0;
 }
 
@@ -158,7 +158,7 @@ int32_t direct_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffe
     if (idlen - 1 > ACL_MAX_IDLEN || s.count == UINT32_MAX || grow > kMaxLength - total) return -1;
     const size_t newtotal = total + grow;
     auto *grown = static_cast<unsigned char *>(acl__realloc(base, newtotal));
-    if (!grown) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_add_acle_to_acl", newtotal);
+    if (!grown) return acl__no_memory("sec_add_acle_to_acl", newtotal);
     acl->value = base = grown;
     std::memmove(base + s.at + grow, base + s.at, total - s.at);
     unsigned char *ent = base + s.at;
@@ -178,7 +178,7 @@ int32_t direct_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffe
 int32_t shrink(sec_acl_buffer_t acl, size_t newtotal) {
     acl->length = static_cast<int32_t>(newtotal);
     void *smaller = acl__realloc(acl->value, newtotal);
-    if (!smaller) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_del_acle_from_acl", newtotal);
+    if (!smaller) return acl__no_memory("sec_del_acle_from_acl", newtotal);
     acl->value = smaller;
     return 0;
 }
@@ -218,9 +218,9 @@ int32_t splice(sec_acl_buffer_t acl, size_t at, size_t old, const unsigned char 
     if (freshlen > old) {
         const size_t grow = freshlen - old;
         if (grow > kMaxLength - total)
-            return acl::set_error(ACL_RC_NO_MEMORY, 89, who, kMaxLength);
+            return acl__no_memory(who, kMaxLength);
         auto *grown = static_cast<unsigned char *>(acl__realloc(base, total + grow));
-        if (!grown) return acl::set_error(ACL_RC_NO_MEMORY, 89, who, total + grow);
+        if (!grown) return acl__no_memory(who, total + grow);
         acl->value = base = grown;
     }
     std::memmove(base + at + freshlen, base + at + old, total - at - old);
@@ -243,7 +243,7 @@ int32_t append(sec_acl_buffer_t acl, const unsigned char *fresh, size_t freshlen
     const unsigned nsub = acl__load_le16(base + 3);
     // The header counts sub-ACLs in 16 bits: a 65536th cannot be recorded,
     // so the ACL is refused as unable to take it.
-    if (nsub == ACL_MAX_SUBACLS) return acl::set_error(ACL_RC_BAD_ACL, 93);
+    if (nsub == ACL_MAX_SUBACLS) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_ACL);
     acl__subacl_cursor<> subs(base, total);
     acl__subacl last;
     int r;
@@ -258,7 +258,7 @@ int32_t append(sec_acl_buffer_t acl, const unsigned char *fresh, size_t freshlen
         r = n;
         at = entries.pos();
     }
-    if (r < 0) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+    if (r < 0) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     if (int32_t rc = splice(acl, at, 0, fresh, freshlen, "sec_add_acle_to_acl", false)) return rc;
     auto *grown = static_cast<unsigned char *>(acl->value);
     if (nsub) acl__store_le32(grown + last.off, static_cast<uint32_t>(at - last.off));
@@ -284,7 +284,7 @@ int32_t tree_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffer_
     size_t freshlen = 0;
     if (!rc) {
         rc = sec__acltree_to_subacl(tree, &fresh, &freshlen);
-        if (!rc && !fresh) rc = acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, rc);
+        if (!rc && !fresh) rc = acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, rc);
     }
     sec__free_acltree(tree);
     if (!rc)
@@ -299,7 +299,7 @@ int32_t tree_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &wh
     size_t used = 0;
     int32_t rc = read_subacl(acl, where, &tree, &used);
     if (!rc && acl__tree_count(tree) == 0)
-        rc = acl::set_error(ACL_RC_BAD_ACLE, 105, e->type, e->mech, e->id ? e->id : "");
+        rc = acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_NOT_IN_ACL, e->type, e->mech, e->id ? e->id : "");
     if (!rc) rc = sec__del_acle_from_tree(e, tree);
     unsigned char *fresh = nullptr;
     size_t freshlen = 0;
@@ -317,15 +317,15 @@ int32_t tree_del(const sec_acle_desc *e, sec_acl_buffer_t acl, const located &wh
 bool direct_road(unsigned type) { return type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP; }
 
 int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_add_acle_to_acl", 1, 0);
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_add_acle_to_acl", 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_add_acle_to_acl", 1, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_add_acle_to_acl", 2, 0);
     sec_acle_desc e;
     if (int32_t rc = take_entry(acle, &e)) return rc;
 
     bool allocated = false;
     if (acl->length == 0 && !acl->value) {
         auto *p = static_cast<unsigned char *>(acl__malloc(ACL_HDR_SIZE));
-        if (!p) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_add_acle_to_acl", ACL_HDR_SIZE);
+        if (!p) return acl__no_memory("sec_add_acle_to_acl", ACL_HDR_SIZE);
         p[0] = ACL_BUF_TYPE;
         p[1] = ACL_BUF_VERSION;
         p[2] = ACL_BUF_HOST_ORDER;
@@ -341,7 +341,7 @@ int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl)
     int32_t rc = locate(acl, &e, &where);
     if (!rc) {
         rc = -1;
-        if (where.found && direct_road(e.type) && acl__edit_direct_enabled)
+        if (where.found && direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
             rc = direct_add(noupdate, &e, acl, where.s);
         if (rc == -1) rc = tree_add(noupdate, &e, acl, where);
     }
@@ -354,17 +354,18 @@ int32_t add_entry(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl)
 }
 
 int32_t del_entry(sec_acle_t acle, sec_acl_buffer_t acl) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_del_acle_from_acl", 1, 0);
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_del_acle_from_acl", 2, 0);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_del_acle_from_acl", 1, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_del_acle_from_acl", 2, 0);
     sec_acle_desc e;
     if (int32_t rc = take_entry(acle, &e)) return rc;
     if (int32_t rc = check_header(acl)) return rc;
     located where;
     if (int32_t rc = locate(acl, &e, &where)) return rc;
     if (!where.found)
-        return acl::set_error(ACL_RC_NO_MATCH, 105, e.type, e.mech, e.id ? e.id : "");
+        return acl::set_error(ACL_RC_NO_MATCH, acl::msg::ACLE_NOT_IN_ACL, e.type, e.mech, e.id ? e.id : "");
     int32_t rc = -1;
-    if (direct_road(e.type) && acl__edit_direct_enabled) rc = direct_del(&e, acl, where.s);
+    if (direct_road(e.type) && acl__edit_direct_enabled.load(std::memory_order_relaxed))
+        rc = direct_del(&e, acl, where.s);
     if (rc == -1) rc = tree_del(&e, acl, where);
     return rc;
 }

@@ -1,6 +1,7 @@
 // Editing compiled ACLs (internal part).
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 
 #include "ryacl.h"
@@ -10,6 +11,7 @@
 int32_t sec__add_acle_to_acl(sec_boolean_t noupdate, sec_acle_t acle, sec_acl_buffer_t acl);
 
 // Test seam: false sends every edit down the tree road, so tests can hold
-// the direct byte-level edit of sorted sub-ACLs against it.  Set it only
-// while no edit runs.
-extern bool acl__edit_direct_enabled;
+// the direct byte-level edit of sorted sub-ACLs against it.  Atomic, so a
+// test that flips it while another thread edits races on nothing; an edit
+// already under way keeps the road it took.
+extern std::atomic<bool> acl__edit_direct_enabled;

@@ -19,7 +19,7 @@ namespace trace = acl::trace;
 
 extern "C" {
 
-sec_perm_desc acl__default_perm_list[13] = {
+const sec_perm_desc acl__default_perm_list[13] = {
     {0x00000001u, 'r', "read", "general purpose read operation"},
     {0x00000002u, 'w', "write", "general purpose write operation"},
     {0x00000004u, 'c', "control", "general purpose control operation"},
@@ -35,7 +35,9 @@ sec_perm_desc acl__default_perm_list[13] = {
     {0x00001000u, 'o', "set", "HVT online/offline/reset resource"},
 };
 
-sec_perm_set_desc acl__default_perm_set = {13, acl__default_perm_list};
+// The record's pointer is not const-qualified (it is the public template set
+// type); nothing writes through it, and the templates stay in read-only memory.
+const sec_perm_set_desc acl__default_perm_set = {13, const_cast<sec_perm_t>(acl__default_perm_list)};
 
 }  // extern "C"
 
@@ -56,7 +58,7 @@ constexpr size_t MECH_MAX = 16;
 
 // Message 88's parameter value is the pointer itself, not the text.
 int32_t bad_param(const char *fn, int pos, const void *value) {
-    return acl::set_error(ACL_RC_BAD_ARGS, 88, fn, pos, value);
+    return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fn, pos, value);
 }
 
 // Copy a mechanism of at most 16 bytes into the record; a longer one cannot
@@ -75,7 +77,7 @@ int32_t create_acle(unsigned char type, uint32_t perm, const char *mech, const c
                     sec_boolean_t translate, sec_acle_t *acle) {
     *acle = nullptr;
     auto *rec = static_cast<sec_acle_t>(acl__calloc(1, sizeof(sec_acle_desc)));
-    if (!rec) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec__create_acle", sizeof(sec_acle_desc));
+    if (!rec) return acl__no_memory("sec__create_acle", sizeof(sec_acle_desc));
     rec->perm = perm;
     rec->type = type;
 
@@ -108,7 +110,7 @@ int32_t create_acle(unsigned char type, uint32_t perm, const char *mech, const c
         } else {
             rec->id = acl__strdup(id);
             if (!rec->id)
-                rc = acl::set_error(ACL_RC_NO_MEMORY, 89, "sec__create_acle", std::strlen(id) + 1);
+                rc = acl__no_memory("sec__create_acle", std::strlen(id) + 1);
         }
     }
     if (rc != ACL_RC_OK) {
@@ -124,7 +126,7 @@ int32_t create_acle(unsigned char type, uint32_t perm, const char *mech, const c
 // the rewritten identity when one was made; the caller frees it.
 int32_t create_acle_checked(unsigned char type, uint32_t perm, const char *mech, const char *id,
                             sec_acle_t *acle, char **built) {
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_create_acle", 1, type);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_create_acle", 1, type);
     if (acl__type_has_mech(type) && (!mech || !*mech || strnlen(mech, MECH_MAX + 1) > MECH_MAX))
         return bad_param("sec_create_acle", 3, mech);
     if (acl__type_has_id(type) && (!id || !*id)) return bad_param("sec_create_acle", 4, id);
@@ -141,12 +143,12 @@ int32_t create_acle_checked(unsigned char type, uint32_t perm, const char *mech,
         if (inet_pton(AF_INET6, rgyname, addr) > 0) {
             char rrgyname[65] = {};
             int nrc = zo_ipaddr_ntop_1(addr, rrgyname, sizeof rrgyname);
-            if (nrc != 0) return acl::set_error(ACL_RC_INTERNAL, 91, ACL_LOC_ACL, nrc);
+            if (nrc != 0) return acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, ACL_LOC_ACL, nrc);
             size_t prefix = static_cast<size_t>(rgyname - id);
             size_t canon = strnlen(rrgyname, sizeof rrgyname - 1);
             size_t need = prefix + canon + 1;
             *built = static_cast<char *>(acl__malloc(need));
-            if (!*built) return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_create_acle", need);
+            if (!*built) return acl__no_memory("sec_create_acle", need);
             std::memcpy(*built, id, prefix);
             std::memcpy(*built + prefix, rrgyname, canon);
             (*built)[prefix + canon] = '\0';
@@ -177,14 +179,14 @@ int32_t display_acle_id(sec_acle_t acle, char **mech, char **id) {
     case SEC_ACLE_TYPE_ANYOTHER:
         return ACL_RC_OK;
     case SEC_ACLE_TYPE_GROUP:
-        if (!acle->id || !*acle->id) return acl::set_error(ACL_RC_BAD_ACLE, 95);
+        if (!acle->id || !*acle->id) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
         return from_utf8(acle->id, id);
     case SEC_ACLE_TYPE_USER:
     case SEC_ACLE_TYPE_EXPANDED: {
         // A mechanism without its NUL inside the 17 bytes is as invalid as an
         // empty one, and must not be read past the field.
         if (!acle->mech[0] || acle->mech[MECH_MAX] != '\0' || !acle->id || !*acle->id)
-            return acl::set_error(ACL_RC_BAD_ACLE, 95);
+            return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
         int32_t rc = from_utf8(acle->mech, mech);
         if (rc == ACL_RC_OK) rc = from_utf8(acle->id, id);
         if (rc != ACL_RC_OK) {
@@ -196,7 +198,7 @@ int32_t display_acle_id(sec_acle_t acle, char **mech, char **id) {
         return rc;
     }
     default:
-        return acl::set_error(ACL_RC_BAD_ACLE, 94, acle->type);
+        return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_NOT_USER_OR_GROUP, acle->type);
     }
 }
 
@@ -214,19 +216,53 @@ int32_t sec__create_acle(unsigned char type, uint32_t perm, const char *mech, co
     return create_acle(type, perm, mech, id, translate, acle);
 }
 
-int32_t sec__translate_perms(const char *ps, sec_perm_set_t permset, uint32_t *perm) {
+namespace {
+
+// The default set's letters as one lookup each: every file entry's
+// permissions go through it.  0 marks a letter that is no template's (no
+// default template has code 0).  Built from the list itself, which never
+// changes, so the two cannot disagree.
+struct letter_table {
+    uint32_t code[256] = {};
+    letter_table() {
+        for (int32_t i = 13; i-- > 0;)  // the first template of a letter wins
+            code[static_cast<unsigned char>(acl__default_perm_list[i].printchar)] = acl__default_perm_list[i].code;
+    }
+};
+
+bool is_default_set(const sec_perm_set_desc *permset) {
+    return permset == &acl__default_perm_set && permset->perms == acl__default_perm_list && permset->count == 13;
+}
+
+}  // namespace
+
+int32_t sec__translate_perms(const char *ps, const sec_perm_set_desc *permset, uint32_t *perm) {
+    if (is_default_set(permset)) {
+        static const letter_table table;
+        uint32_t bits = 0;
+        for (const char *c = ps; *c; ++c) {
+            const uint32_t code = table.code[static_cast<unsigned char>(*c)];
+            if (!code) {
+                *perm |= bits;
+                return acl::set_error(ACL_RC_PERMISSION, acl::msg::BAD_PERM_LETTER, static_cast<unsigned char>(*c));
+            }
+            bits |= code;
+        }
+        *perm |= bits;
+        return ACL_RC_OK;
+    }
     const int32_t count = permset->count > 0 && permset->perms ? permset->count : 0;
     for (const char *c = ps; *c; ++c) {
         int32_t i = 0;
         while (i < count && permset->perms[i].printchar != *c) ++i;
         if (i == count)
-            return acl::set_error(ACL_RC_PERMISSION, 133, static_cast<unsigned char>(*c));
+            return acl::set_error(ACL_RC_PERMISSION, acl::msg::BAD_PERM_LETTER, static_cast<unsigned char>(*c));
         *perm |= permset->perms[i].code;
     }
     return ACL_RC_OK;
 }
 
-int32_t sec__translate_bitmask(uint32_t pbm, sec_perm_set_t permset, char *perm) {
+int32_t sec__translate_bitmask(uint32_t pbm, const sec_perm_set_desc *permset, char *perm) {
     const int32_t count = permset->count > 0 && permset->perms ? permset->count : 0;
     size_t out = 0;  // at most 32 letters: one per bit
     int32_t rc = ACL_RC_OK;
@@ -235,7 +271,7 @@ int32_t sec__translate_bitmask(uint32_t pbm, sec_perm_set_t permset, char *perm)
         if (!(pbm & bit)) continue;
         int32_t i = 0;
         while (i < count && permset->perms[i].code != bit) ++i;
-        if (i == count) rc = acl::set_error(ACL_RC_PERMISSION, 164, bit);
+        if (i == count) rc = acl::set_error(ACL_RC_PERMISSION, acl::msg::BAD_PERM_BIT, bit);
         else perm[out++] = permset->perms[i].printchar;
     }
     // Terminated on failure too, so a careless reader of the area stays in it.

@@ -7,9 +7,10 @@
 #include "ryacl.h"
 
 extern "C" {
-// The 13 default templates and the set that points at them.
-extern sec_perm_desc acl__default_perm_list[13];
-extern sec_perm_set_desc acl__default_perm_set;
+// The 13 default templates and the set that points at them.  Both are
+// read-only: every caller shares them, so none may change a template.
+extern const sec_perm_desc acl__default_perm_list[13];
+extern const sec_perm_set_desc acl__default_perm_set;
 }
 
 // True for the five entry type codes.
@@ -32,14 +33,32 @@ int32_t sec__create_acle(unsigned char type, uint32_t perm, const char *mech, co
                          sec_boolean_t translate, sec_acle_t *acle);
 
 // Letters to mask, ORed into *perm (not cleared first).  permset required.
-int32_t sec__translate_perms(const char *ps, sec_perm_set_t permset, uint32_t *perm);
+int32_t sec__translate_perms(const char *ps, const sec_perm_set_desc *permset, uint32_t *perm);
 // Mask to letters into perm (33 bytes).  permset required.
-int32_t sec__translate_bitmask(uint32_t pbm, sec_perm_set_t permset, char *perm);
+int32_t sec__translate_bitmask(uint32_t pbm, const sec_perm_set_desc *permset, char *perm);
 
 // Parse one line of ACL text in place.  *tacl is the cursor (null when the
 // text is used up), *length the bytes from the cursor to the end with the
 // terminating NUL, *lineno the number of the line being parsed.  Returns 0
 // at the end of the text, 1 when a line was consumed (acle->type 0 for a
 // blank or comment line), or a return code for a faulty line (consumed).
-int32_t sec__read_acle_from_text(sec_perm_set_t permset, char **tacl, size_t *length,
+int32_t sec__read_acle_from_text(const sec_perm_set_desc *permset, char **tacl, size_t *length,
                                  int32_t *lineno, sec_acle_t acle);
+
+// A faulty line's report, kept so that a caller that parses ahead can
+// record it when it reaches the line.  token points into the text.
+struct acl__line_fault {
+    int32_t rc = 0;
+    int32_t msg = 0;
+    int32_t line = 0;
+    const char *token = nullptr;
+    size_t length = 0;  // the line's bytes with its terminator
+};
+// sec__read_acle_from_text that records nothing: a faulty line's report
+// goes to *fault and its code is returned.  The thread's error may have
+// been changed on the way (a permission letter's message) and is not the
+// line's until acl__record_line_fault is called.
+int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
+                                sec_acle_t acle, acl__line_fault *fault);
+// Record the report as sec__read_acle_from_text does; returns its code.
+int32_t acl__record_line_fault(const acl__line_fault &fault);

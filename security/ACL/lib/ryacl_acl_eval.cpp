@@ -22,15 +22,15 @@ using acl::trace::val;
 // header is refused before any byte of it is read.
 int32_t check_acl(const sec_acl_buffer_desc *acl) {
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (acl->length <= 0 || !p) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length <= 0 || !p) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
-    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
-    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, 102);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     return 0;
 }
 
-int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, 97, "security/ACL/lib/ryacl_acl", line); }
+int32_t corrupted(int line) { return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, "security/ACL/lib/ryacl_acl", line); }
 
 // Handlers and comparisons get an identifier in place: it must end on the
 // NUL inside its own length (114 otherwise).
@@ -47,7 +47,7 @@ template <class Cmp>
     acl__entry e;
     int r;
     while ((r = walk.next(&e)) == 1) {
-        if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, 114, ACL_LOC_ACL);
+        if (!id_ends(e)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_ID_LENGTH, ACL_LOC_ACL);
         const int c = cmp(e);
         if (c == 0) {
             *perm = e.perm;
@@ -66,21 +66,21 @@ int32_t match_name(const acl__entry_cursor<> &walk, const char *name, uint32_t *
 }
 
 int32_t no_entry(unsigned type, const char *mech, const char *id) {
-    return acl::set_error(ACL_RC_BAD_ACLE, 134, type, mech ? mech : "", id ? id : "");
+    return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::NO_MATCH, type, mech ? mech : "", id ? id : "");
 }
 
 int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, const char *zmech,
                     const char *id, uint32_t *perm) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__single_acle_perm", 1, 0);
-    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__single_acle_perm", 6, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__single_acle_perm", 1, 0);
+    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__single_acle_perm", 6, 0);
     if (int32_t rc = check_acl(acl)) return rc;
     const unsigned acletype = type & 0x1fu;
     // Groups are evaluated only as a set.
     if (!acl__valid_type(acletype) || acletype == SEC_ACLE_TYPE_GROUP)
-        return acl::set_error(ACL_RC_BAD_ARGS, 115, type);
+        return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_EVAL_TYPE, type);
     const bool named = acl__type_has_mech(acletype);
-    if (named && (!mech || !*mech)) return acl::set_error(ACL_RC_BAD_ARGS, 116);
-    if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, 117);
+    if (named && (!mech || !*mech)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::MECH_REQUIRED);
+    if (named && (!id || !*id)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::ID_REQUIRED);
 
     *perm = 0;
     acl__subacl s;
@@ -95,7 +95,7 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
     acl__entry e;
     int r;
     if (!named) {
-        if (s.count > 1) return acl::set_error(ACL_RC_BAD_ACL, 109, ACL_LOC_ACL);
+        if (s.count > 1) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::SUBACL_SINGLE_REPEATED, ACL_LOC_ACL);
         // A sub-ACL of no entries (made outside the library) grants nothing
         // and is reported as a missing entry.
         r = walk.next(&e);
@@ -128,14 +128,14 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
 }
 
 int32_t group_perm(sec_acl_buffer_t acl, int32_t count, sec_buffer_t groups, uint32_t *perm) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 1, 0);
-    if (count != 0 && !groups) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 3, 0);
-    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 4, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 1, 0);
+    if (count != 0 && !groups) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 3, 0);
+    if (!perm) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 4, 0);
     if (int32_t rc = check_acl(acl)) return rc;
     // A name that is not there cannot be compared; refuse the array before
     // anything is written, the way a null array is refused.
     for (int32_t g = 0; g < count; ++g)
-        if (!groups[g].value) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__group_acles_perm", 3, 0);
+        if (!groups[g].value) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__group_acles_perm", 3, 0);
 
     *perm = 0;
     if (count == 0) return 0;

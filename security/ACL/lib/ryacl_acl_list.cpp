@@ -27,11 +27,11 @@ int32_t check_acl(const sec_acl_buffer_desc *acl, bool *empty) {
         *empty = true;
         return 0;
     }
-    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (acl->length <= 0 || !acl->value) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     if (acl->length < ACL_HDR_SIZE)
-        return acl::set_error(ACL_RC_BAD_ACL, 106, acl->length, ACL_LOC_ACL);
+        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_TOO_SHORT, acl->length, ACL_LOC_ACL);
     const auto *p = static_cast<const unsigned char *>(acl->value);
-    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, 96);
+    if (p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::NOT_ACL_BUFFER);
     return 0;
 }
 
@@ -39,7 +39,7 @@ int32_t check_acl(const sec_acl_buffer_desc *acl, bool *empty) {
 // is not the last may not spill into the next.  Its header must lie there
 // too (97 otherwise), for any sub-ACL visited.
 int32_t expand(const unsigned char *base, const acl__subacl &s, sec_acle_list_t list, bool wanted) {
-    if (!s.header_fits()) return acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL);
+    if (!s.header_fits()) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL);
     if (!wanted) return 0;
     sec_acltree_t tree = nullptr;
     int32_t rc = sec__subacl_to_acltree(base + s.off, s.room(), &tree);
@@ -56,7 +56,7 @@ int32_t expand_all(const sec_acl_buffer_desc *acl, unsigned type, sec_acle_list_
     int r;
     while ((r = subs.next(&s)) == 1)
         if (int32_t rc = expand(p, s, list, type == 0 || s.type == type)) return rc;
-    return r < 0 ? acl::set_error(ACL_RC_BAD_ACL, 97, ACL_LOC_ACL) : 0;
+    return r < 0 ? acl::set_error(ACL_RC_BAD_ACL, acl::msg::ACL_CORRUPTED, ACL_LOC_ACL) : 0;
 }
 
 // A list that was being filled is emptied by a failure; a list refused
@@ -74,8 +74,8 @@ int32_t released_on_failure(int32_t rc, sec_acle_list_t list) {
 }
 
 int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 1, 0);
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl", 2, 0);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 1, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl", 2, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;
@@ -86,16 +86,16 @@ int32_t list_acl(sec_acl_buffer_t acl, sec_acle_list_t list) {
 
 int32_t list_by_type(sec_acl_buffer_t acl, unsigned char type, const char *mech,
                      sec_acle_list_t list) {
-    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 1, 0);
-    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 2, type);
+    if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 1, 0);
+    if (!acl__valid_type(type)) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 2, type);
     const bool has_mech = acl__type_has_mech(type);
     if (has_mech && mech) {
         const size_t mlen = strnlen(mech, 17);
         if (mlen == 0 || mlen > 16)
-            return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 3,
+            return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 3,
                                   static_cast<const void *>(mech));
     }
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_list_acl_by_type", 4, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_list_acl_by_type", 4, 0);
     bool empty = false;
     if (int32_t rc = check_acl(acl, &empty)) return rc;
     list->count = 0;

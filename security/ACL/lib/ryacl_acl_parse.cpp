@@ -1,5 +1,8 @@
 // The ACL text parser: one line per call, in place, no allocation.
+#include <langinfo.h>
+
 #include <cctype>
+#include <clocale>
 #include <cstdint>
 #include <cstring>
 
@@ -8,49 +11,70 @@
 #include "ryacl_error.h"
 #include "ryacl_trace.h"
 
-#ifndef __GLIBC__
-#error "the parser classifies bytes through the C library's ctype table"
-#endif
-
 namespace {
 
 // Longest line, its terminator (or the text's final NUL) counted.
 constexpr size_t LINE_MAX_BYTES = 1096;
 constexpr size_t MECH_MAX = 16;
 
-// Fixed byte classes of the syntax.
-enum : unsigned char { C_TERM = 1, C_NUL = 2, C_BLANK = 4, C_HASH = 8 };
+// Byte classes of the syntax, one table lookup per byte.
+enum : unsigned char { C_TERM = 1, C_NUL = 2, C_BLANK = 4, C_HASH = 8, C_TOKEN = 16 };
 constexpr unsigned char C_LINE_END = C_TERM | C_NUL;
 constexpr unsigned char C_END_MARK = C_TERM | C_NUL | C_HASH;
 
-struct class_table {
-    unsigned char c[256] = {};
-    constexpr class_table() {
-        for (unsigned char b : {'\n', '\f', '\r'}) c[b] = C_TERM;
-        for (unsigned char b : {' ', '\t', '\v'}) c[b] = C_BLANK;
-        c[0] = C_NUL;
-        c[static_cast<unsigned char>('#')] = C_HASH;
+// The classes of the calling thread's locale.  Token characters depend on
+// its isspace; locale space bytes that are neither blanks nor terminators
+// separate tokens like blanks, so a token is never empty.  The table is
+// built through the public isspace once per LC_CTYPE locale a thread
+// parses in, and found again by the locale's name, which follows both
+// setlocale and uselocale.
+class class_table {
+public:
+    const unsigned char *current() {
+        const char *name = nl_langinfo(NL_LOCALE_NAME(LC_CTYPE));
+        if (!name) name = "";
+        if (!built_ || !same_name(name)) build(name);
+        return cls_;
     }
+
+private:
+    // Locale names are a few bytes: a loop beats a call.
+    bool same_name(const char *name) const {
+        size_t i = 0;
+        for (; name_[i] == name[i]; ++i)
+            if (name[i] == '\0') return true;
+        return false;
+    }
+
+    void build(const char *name) {
+        for (unsigned b = 0; b < 256; ++b) {
+            unsigned char c = 0;
+            if (b == '\n' || b == '\f' || b == '\r') c = C_TERM;
+            else if (b == 0) c = C_NUL;
+            else if (b == ' ' || b == '\t' || b == '\v' || std::isspace(static_cast<int>(b))) c = C_BLANK;
+            else c = C_TOKEN;
+            if (b == '#') c |= C_HASH;
+            cls_[b] = c;
+        }
+        // A name too long to keep is compared on its first bytes only, so
+        // it is rebuilt on every call rather than taken for another locale.
+        built_ = std::strlen(name) < sizeof name_;
+        std::strncpy(name_, name, sizeof name_ - 1);
+    }
+    unsigned char cls_[256] = {};
+    char name_[128] = {};
+    bool built_ = false;
 };
-constexpr class_table k_cls;
 
-// Classification for one call.  Token characters depend on the locale's
-// isspace.  glibc's isspace is itself a lookup in the calling thread's ctype
-// table; taking that table once per call follows setlocale and uselocale
-// with no cache to invalidate and no per-byte call.  Locale space bytes that
-// are neither blanks nor terminators separate tokens like blanks, so a token
-// is never empty.
+thread_local class_table t_classes;
+
 struct classifier {
-    const unsigned short *ct = *__ctype_b_loc();
+    const unsigned char *c = t_classes.current();
 
-    static unsigned char fixed(unsigned char b) { return k_cls.c[b]; }
-    bool space(unsigned char b) const { return ct[b] & static_cast<unsigned short>(_ISspace); }
-    bool token(unsigned char b) const { return !(fixed(b) & C_LINE_END) && !space(b); }
-    bool blank(unsigned char b) const {
-        return (fixed(b) & C_BLANK) || (space(b) && !(fixed(b) & C_LINE_END));
-    }
-    static bool end_mark(unsigned char b) { return fixed(b) & C_END_MARK; }
-    static bool line_end(unsigned char b) { return fixed(b) & C_LINE_END; }
+    bool token(unsigned char b) const { return c[b] & C_TOKEN; }
+    bool blank(unsigned char b) const { return c[b] & C_BLANK; }
+    bool end_mark(unsigned char b) const { return c[b] & C_END_MARK; }
+    bool line_end(unsigned char b) const { return c[b] & C_LINE_END; }
 };
 
 // Parse state of one line.  Every scan stops at the text's final NUL, which
@@ -79,7 +103,7 @@ struct line_parser {
     token read_token() {
         unsigned char *s = p;
         while (cl.token(*p)) ++p;
-        token t{reinterpret_cast<char *>(s), static_cast<size_t>(p - s), classifier::line_end(*p)};
+        token t{reinterpret_cast<char *>(s), static_cast<size_t>(p - s), cl.line_end(*p)};
         if (t.ends_line) note_end(p);
         *p = '\0';
         if (!t.ends_line) ++p;
@@ -90,8 +114,8 @@ struct line_parser {
     // mark follows (the line end is noted unless it is a comment).
     bool at_end_mark() {
         while (cl.blank(*p)) ++p;
-        if (!classifier::end_mark(*p)) return false;
-        if (classifier::line_end(*p)) note_end(p);
+        if (!cl.end_mark(*p)) return false;
+        if (cl.line_end(*p)) note_end(p);
         return true;
     }
 
@@ -122,25 +146,25 @@ unsigned char type_code(const line_parser::token &t) {
     }
 }
 
-fault missing() { return {ACL_RC_BAD_ACL, 158, nullptr}; }
-fault extra() { return {ACL_RC_BAD_ACL, 159, nullptr}; }
+fault missing() { return {ACL_RC_BAD_ACL, acl::msg::LINE_TOO_FEW_TOKENS.num, nullptr}; }
+fault extra() { return {ACL_RC_BAD_ACL, acl::msg::LINE_TOO_MANY_TOKENS.num, nullptr}; }
 
 // The permission token, then nothing but a comment.
-fault permissions(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
+fault permissions(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t acle) {
     line_parser::token t = lp.read_token();
     if (sec__translate_perms(t.s, permset, &acle->perm) != ACL_RC_OK)
-        return {ACL_RC_PERMISSION, 166, t.s};
+        return {ACL_RC_PERMISSION, acl::msg::LINE_BAD_PERMS.num, t.s};
     if (t.ends_line || lp.at_end_mark()) return {};
     return extra();
 }
 
 // The tokens of one line into acle.
-fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
+fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t acle) {
     if (lp.at_end_mark()) return {};  // blank or comment line
 
     line_parser::token t = lp.read_token();
     const unsigned char type = type_code(t);
-    if (!type) return {ACL_RC_BAD_ACL, 165, t.s};
+    if (!type) return {ACL_RC_BAD_ACL, acl::msg::LINE_BAD_TYPE.num, t.s};
     acle->type = type;
     const bool no_names = !acl__type_has_id(type);  // unauthenticated, anyother
 
@@ -151,7 +175,7 @@ fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
     if (type == SEC_ACLE_TYPE_GROUP) {
         acle->id = t.s;
     } else {
-        if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, 132, t.s};
+        if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, acl::msg::LINE_MECH_TOO_LONG.num, t.s};
         for (size_t i = 0; i < t.len; ++i) {
             t.s[i] = static_cast<char>(zo_tolower_posix_1(static_cast<unsigned char>(t.s[i])));
             acle->mech[i] = t.s[i];
@@ -167,59 +191,75 @@ fault parse_entry(line_parser &lp, sec_perm_set_t permset, sec_acle_t acle) {
     return permissions(lp, permset, acle);
 }
 
-// A text whose length does not end at a NUL would have every scan run off
-// its end; it is refused as corrupted, and consumed whole.
-int32_t refuse_unterminated(char **tacl, size_t *length, int32_t *lineno) {
-    int32_t rc = acl::set_error(ACL_RC_BAD_ACL, 131, *lineno);
-    *tacl = nullptr;
-    *length = 0;
-    if (*lineno < INT32_MAX) ++*lineno;
-    return rc;
-}
-
 }  // namespace
 
-int32_t sec__read_acle_from_text(sec_perm_set_t permset, char **tacl, size_t *length,
-                                 int32_t *lineno, sec_acle_t acle) {
+int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
+                                sec_acle_t acle, acl__line_fault *out) {
     std::memset(acle, 0, sizeof *acle);
     char *const start = *tacl;
     const size_t remaining = *length;
     // A NUL at the cursor is the end only when it is the text's final one;
     // an earlier one is a stray NUL, reported below as its line's fault.
     if (!start || remaining == 0) return 0;
-    if (start[remaining - 1] != '\0') return refuse_unterminated(tacl, length, lineno);
-    if (remaining == 1) return 0;
-    if (!permset) permset = &acl__default_perm_set;
-
-    line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
-    fault f = parse_entry(lp, permset, acle);
-    lp.find_end();
-
-    const size_t consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
     const int32_t line = *lineno;
-    if (consumed > LINE_MAX_BYTES) {
-        const int32_t len32 = consumed > INT32_MAX ? INT32_MAX : static_cast<int32_t>(consumed);
-        acl::trace::point(acl::trace::ERRORS, 115, {acl::trace::val(line), acl::trace::val(len32)});
-        f = {ACL_RC_FILE_ERROR, 145, nullptr};
-    }
-    if (lp.last) {
-        // Nothing after a NUL is parsed, so the text is used up either way.
-        if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, 131, nullptr};
+    fault f;
+    size_t consumed = 0;
+    if (start[remaining - 1] != '\0') {
+        // A text whose length does not end at a NUL would have every scan
+        // run off its end; it is refused as corrupted, and consumed whole.
+        f = {ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED.num, nullptr};
         *tacl = nullptr;
         *length = 0;
     } else {
-        *tacl = start + consumed;
-        *length = remaining - consumed;
+        if (remaining == 1) return 0;
+        if (!permset) permset = &acl__default_perm_set;
+
+        line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
+        f = parse_entry(lp, permset, acle);
+        lp.find_end();
+
+        consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
+        if (consumed > LINE_MAX_BYTES) f = {ACL_RC_FILE_ERROR, acl::msg::LINE_TOO_LONG.num, nullptr};
+        if (lp.last) {
+            // Nothing after a NUL is parsed, so the text is used up either way.
+            if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED.num, nullptr};
+            *tacl = nullptr;
+            *length = 0;
+        } else {
+            *tacl = start + consumed;
+            *length = remaining - consumed;
+        }
     }
     if (*lineno < INT32_MAX) ++*lineno;
-
     if (f.rc == ACL_RC_OK) return 1;
+    *out = {f.rc, f.msg, line, f.token, consumed};
+    return f.rc;
+}
+
+int32_t acl__record_line_fault(const acl__line_fault &f) {
+    if (f.msg == acl::msg::LINE_TOO_LONG.num) {
+        const int32_t len32 = f.length > INT32_MAX ? INT32_MAX : static_cast<int32_t>(f.length);
+        acl::trace::point(acl::trace::ERRORS, 115, {acl::trace::val(f.line), acl::trace::val(len32)});
+    }
     // A permission token that did not translate left message 133 behind;
     // the line's own message replaces it.
     acl::clear_error();
+    // Each message by name, so its arguments are checked where it is recorded.
+    using namespace acl::msg;
     switch (f.msg) {
-    case 132: return acl::set_error(f.rc, f.msg, f.token, line);
-    case 165: case 166: return acl::set_error(f.rc, f.msg, line, f.token);
-    default: return acl::set_error(f.rc, f.msg, line);
+    case LINE_MECH_TOO_LONG.num: return acl::set_error(f.rc, LINE_MECH_TOO_LONG, f.token, f.line);
+    case LINE_BAD_TYPE.num: return acl::set_error(f.rc, LINE_BAD_TYPE, f.line, f.token);
+    case LINE_BAD_PERMS.num: return acl::set_error(f.rc, LINE_BAD_PERMS, f.line, f.token);
+    case LINE_TOO_FEW_TOKENS.num: return acl::set_error(f.rc, LINE_TOO_FEW_TOKENS, f.line);
+    case LINE_TOO_MANY_TOKENS.num: return acl::set_error(f.rc, LINE_TOO_MANY_TOKENS, f.line);
+    case LINE_TOO_LONG.num: return acl::set_error(f.rc, LINE_TOO_LONG, f.line);
+    default: return acl::set_error(f.rc, LINE_CORRUPTED, f.line);
     }
+}
+
+int32_t sec__read_acle_from_text(const sec_perm_set_desc *permset, char **tacl, size_t *length,
+                                 int32_t *lineno, sec_acle_t acle) {
+    acl__line_fault f;
+    const int32_t rc = acl__read_acle_deferred(permset, tacl, length, lineno, acle, &f);
+    return rc == 0 || rc == 1 ? rc : acl__record_line_fault(f);
 }

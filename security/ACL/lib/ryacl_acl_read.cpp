@@ -7,7 +7,9 @@
 // look at the cache name and the open, the name may come to denote another
 // file; the open never follows a link and never blocks, and the descriptor
 // must still be the regular file whose owner, group, mode and time were
-// checked, or the cache is passed over too.
+// checked, or the cache is passed over too.  The text file itself is
+// opened first and vetted through its descriptor (ryacl_acl_textfile.cpp),
+// so a text replaced meanwhile is simply read in its new version.
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -45,24 +47,37 @@ int cache_unusable(const struct stat &acl_st, const struct stat &c) {
     return 0;
 }
 
+// Each parsed entry, for the trace at "Info" levels above 7; faults stop
+// the parse and stay the current error.
+struct trace_sink final : acl__text_sink {
+    void fault(int32_t, int32_t) override {}
+    void entry(const sec_acle_desc &e, int32_t line) override {
+        tr::record_data(114, {tr::val(line + 1), tr::val(e.type), tr::val(e.perm),
+                              tr::strn(e.mech, sizeof e.mech), tr::str(e.id)});
+    }
+};
+
 struct reader {
     const char *filename;
     const char *username;
-    sec_perm_set_t permtmpl;
+    const sec_perm_set_desc *permtmpl;
     sec_buffer_t acl;
     uint32_t flags;  // the working copy
     int32_t lineno = 0;
-    char aclfname[ACL_FNAME_AREA] = {};
+    acl__aclfile_s text;  // the text file, opened and vetted
+    const char *aclfname = text.name;
     char caclfname[ACL_FNAME_AREA] = {};
-    struct stat acl_st {};
     struct stat cache_st {};
     char *aclfbuf = nullptr;
     size_t aclfsize = 0;
+    acl__textfile_opts opts{ACL_RC_FILE_ERROR, acl::msg::BAD_FILE.num, acl::msg::FILE_NOT_OWNED.num, acl::msg::FILE_OPEN.num, true, false,
+                            tr::level(tr::INFO) > 7, permtmpl};
 
+    reader(const char *fn, const char *un, const sec_perm_set_desc *pt, sec_buffer_t a, uint32_t f)
+        : filename(fn), username(un), permtmpl(pt), acl(a), flags(f) {}
     int32_t run();
     bool choose_cache();
     bool take_cache();
-    int32_t read_text();
     int32_t parse();
 
     void fall_back(int why) {
@@ -92,7 +107,7 @@ bool reader::choose_cache() {
     std::memcpy(caclfname + n, ACL_CACHE_SUFFIX, sizeof ACL_CACHE_SUFFIX);
     int why = 0;
     if (stat(caclfname, &cache_st) != 0) why = -errno;
-    else why = cache_unusable(acl_st, cache_st);
+    else why = cache_unusable(text.st, cache_st);
     tr::point(tr::INFO, 117, {tr::str(caclfname), tr::val(why)});
     if (why) {
         flags |= SEC_ACLF_FROM_TEXT;
@@ -111,7 +126,7 @@ bool reader::take_cache() {
     }
     tr::point(tr::INFO, 119, {tr::str(caclfname)});
     struct stat fst;
-    if (fstat(fd, &fst) != 0 || !same_file(fst, cache_st) || cache_unusable(acl_st, fst) ||
+    if (fstat(fd, &fst) != 0 || !same_file(fst, cache_st) || cache_unusable(text.st, fst) ||
         fst.st_mtime != cache_st.st_mtime) {
         close(fd);
         fall_back(4);
@@ -145,62 +160,15 @@ bool reader::take_cache() {
     return true;
 }
 
-// Step 9 for the text file.
-int32_t reader::read_text() {
-    acl__file_step("read:open", aclfname);
-    int fd = open(aclfname, O_RDONLY | O_CLOEXEC | O_NONBLOCK);
-    if (fd < 0) return acl::set_error(ACL_RC_FILE_ERROR, 124, aclfname, errno);
-    // Only the file whose type, owner and mode were checked is read: the
-    // name may have come to denote another since (a link to a file the
-    // caller never vetted, a FIFO, a device, a huge file).  The change time
-    // tells a new file that reuses the inode number of a deleted one, and
-    // one changed since the look.  Such a swap fails no call, so it is
-    // reported with errno 0, like a file that is not regular.
-    struct stat fst;
-    const int frc = fstat(fd, &fst);
-    const int err = frc != 0 ? errno : 0;
-    if (frc != 0 || !same_file(fst, acl_st) || fst.st_ctim.tv_sec != acl_st.st_ctim.tv_sec ||
-        fst.st_ctim.tv_nsec != acl_st.st_ctim.tv_nsec) {
-        close(fd);
-        return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, err);
-    }
-    tr::point(tr::INFO, 119, {tr::str(aclfname)});
-    tr::perf_timer step(2);
-    int32_t rc = acl__lock_acl_file(aclfname, fd, 1);
-    if (!rc) rc = acl__read_acl_file(aclfname, fd, &aclfbuf, &aclfsize);
-    close(fd);
-    if (step.armed()) step.record(4, {tr::str(aclfname)});
-    return rc;
-}
-
 // Steps 10 to 12.
 int32_t reader::parse() {
     flags &= ~static_cast<uint32_t>(SEC_ACLF_CONVERT_CACHE);
     tr::perf_timer timer(1);
     acl__trees_s trees;
-    int32_t rc = 0;
-    lineno = 1;
-    if (aclfbuf) {
-        char *cursor = aclfbuf;
-        size_t left = aclfsize + 1;
-        sec_acle_desc entry;
-        for (;;) {
-            std::memset(&entry, 0, sizeof entry);
-            int32_t r = sec__read_acle_from_text(permtmpl, &cursor, &left, &lineno, &entry);
-            if (r == 0) break;
-            if (r != 1) {
-                rc = r;
-                break;
-            }
-            if (entry.type == 0) continue;
-            if (tr::level(tr::INFO) > 7) {
-                tr::record_data(114, {tr::val(lineno), tr::val(entry.type), tr::val(entry.perm),
-                                      tr::strn(entry.mech, sizeof entry.mech), tr::str(entry.id)});
-            }
-            rc = sec__add_acle_to_trees(&entry, &trees);
-            if (rc) break;
-        }
-    }
+    acl__parse_result res;
+    trace_sink sink;
+    int32_t rc = acl__parse_acltext(aclfbuf, aclfsize, opts, sink, &trees, &res);
+    lineno = res.lineno;
     if (!rc && trees.nooftrees > 0) rc = sec__acltrees_to_acl(&trees, acl);
     acl__free_trees(&trees);
     if (timer.armed()) timer.record(3, {tr::str(aclfname), tr::val(lineno)});
@@ -223,14 +191,9 @@ int32_t reader::parse() {
 }
 
 int32_t reader::run() {
-    uid_t uid = 0;
-    int32_t rc = sec__get_aclfname(filename, username, aclfname, &uid);
+    int32_t rc = acl__open_aclfile(filename, username, opts, &text);
     if (rc) return rc;
-    if (stat(aclfname, &acl_st) != 0) return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, errno);
-    if (!S_ISREG(acl_st.st_mode)) return acl::set_error(ACL_RC_FILE_ERROR, 122, aclfname, 0);
-    if (acl_st.st_size == 0) return 0;
-    if (username && (acl_st.st_uid != uid || (acl_st.st_mode & 022)))
-        return acl::set_error(ACL_RC_PERMISSION, 128, aclfname, username);
+    if (text.st.st_size == 0) return 0;
 
     tr::perf_timer choice(1);
     bool cache = choose_cache();
@@ -240,7 +203,13 @@ int32_t reader::run() {
         if (reading.armed()) reading.record(2, {tr::str(caclfname)});
         return 0;
     }
-    rc = read_text();
+    // The text was found but could not be opened; with a usable cache that
+    // did not matter.
+    if (text.fd < 0) return acl__open_failed(opts, text);
+    tr::point(tr::INFO, 119, {tr::str(aclfname)});
+    tr::perf_timer step(2);
+    rc = acl__read_aclfile(&text, &aclfbuf, &aclfsize);
+    if (step.armed()) step.record(4, {tr::str(aclfname)});
     if (reading.armed()) reading.record(2, {tr::str(aclfname)});
     if (rc) return rc;
     return parse();
@@ -258,11 +227,11 @@ int32_t sec_read_acl_file(const char *filename, const char *username, sec_perm_s
     int32_t lineno = 0;
     uint32_t wflags = flags;
     if (!filename) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 1, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 1, 0);
     } else if (!acl) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "sec_read_acl_file", 5, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec_read_acl_file", 5, 0);
     } else if (username && !*username) {
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 121);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_USER_NAME);
     } else {
         acl->length = 0;
         acl->value = nullptr;

@@ -1,4 +1,6 @@
-// ACL trees.  A tree keeps the entries of one sub-ACL in insertion order in
+// One sub-ACL's entries (an "ACL tree", see ryacl_acl_tree.h): the arena,
+// the hash index, insertion, deletion and the ordered visit.  A tree keeps
+// the entries of one sub-ACL in insertion order in
 // a compact array, their identifiers (and any mechanism spelling that
 // differs from the first entry's) in one byte arena, and finds duplicates
 // without comparing along a path: while identifiers arrive in one
@@ -11,7 +13,7 @@
 //
 // The order a writer needs is produced only when entries are visited:
 // insertion order for expanded entries, ascending case-insensitive
-// identifier for user and group entries.  An ascending tree is walked
+// identifier for user and group entries (ryacl_acl_sort.cpp).  An ascending tree is walked
 // forwards, a descending one backwards; otherwise only the part after the
 // ascending prefix is sorted and merged in, so one entry added to a tree
 // read back costs a walk, not a sort.
@@ -21,15 +23,14 @@
 // one-entry trees, and several blocks each would blow the memory budget.
 #include "ryacl_acl_tree.h"
 
-#include <sys/mman.h>
-
+#include <cstddef>
 #include <cstdlib>
 #include <cstring>
-#include <utility>
 
 #include "ry_zo_int.h"
 #include "ryacl_acl_entry.h"
 #include "ryacl_alloc.h"
+#include "ryacl_acl_sort.h"
 #include "ryacl_error.h"
 #include "ryacl_trace.h"
 
@@ -95,7 +96,7 @@ const char *inline_bytes(const tree *t) {
 int32_t size_arg(size_t n) { return n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n); }
 
 int32_t no_memory(const char *fname, size_t n) {
-    return acl::set_error(ACL_RC_NO_MEMORY, 89, fname, size_arg(n));
+    return acl__no_memory(fname, size_arg(n));
 }
 
 bool has_id(unsigned t) { return acl__type_has_id(t); }
@@ -106,41 +107,13 @@ bool sorted_type(unsigned t) { return t == SEC_ACLE_TYPE_USER || t == SEC_ACLE_T
 // The order and equality of zo_strcasecmp_posix_1: A-Z fold onto a-z, every
 // other byte compares as its unsigned value.
 
-using zo::fold;
-using zo::fold8;
-using zo::load8;
+using zo::fold_eq;
+using zo::fold_hash;
 
-bool fold_eq(const char *a, const char *b, size_t n) {
-    size_t i = 0;
-    for (; i + 8 <= n; i += 8)
-        if (fold8(load8(a + i)) != fold8(load8(b + i))) return false;
-    for (; i < n; ++i)
-        if (fold(static_cast<unsigned char>(a[i])) != fold(static_cast<unsigned char>(b[i]))) return false;
-    return true;
-}
-
-uint32_t fold_hash(const char *s, size_t n, uint64_t seed = 0) {
-    uint64_t h = 0x9e3779b97f4a7c15ull ^ seed ^ n;
-    size_t i = 0;
-    for (; i + 8 <= n; i += 8) {
-        h ^= fold8(load8(s + i));
-        h *= 0xff51afd7ed558ccdull;
-        h ^= h >> 29;
-    }
-    uint64_t tail = 0;
-    for (unsigned sh = 0; i < n; ++i, sh += 8) tail |= uint64_t{fold(static_cast<unsigned char>(s[i]))} << sh;
-    h ^= tail;
-    h *= 0xc4ceb9fe1a85ec53ull;
-    h ^= h >> 32;
-    h *= 0xff51afd7ed558ccdull;
-    h ^= h >> 29;
-    return static_cast<uint32_t>(h >> 32);
-}
-
-inline size_t slot_of(uint32_t h, uint32_t mask) { return (h >> 2) & mask; }
-inline uint64_t slot_value(uint32_t h, uint32_t i) { return (uint64_t{h} << 32) | (uint64_t{i} + 1); }
-inline uint32_t slot_hash(uint64_t v) { return static_cast<uint32_t>(v >> 32); }
-inline uint32_t slot_entry(uint64_t v) { return static_cast<uint32_t>(v) - 1; }
+using acl__slot::slot_entry;
+using acl__slot::slot_hash;
+using acl__slot::slot_of;
+using acl__slot::slot_value;
 
 // ---- Reading entries ---------------------------------------------------------
 
@@ -189,230 +162,6 @@ acl__tree_entry_view make_view(const tree *t, const tview &v, const ent &e) {
     return r;
 }
 
-// ---- Ordering ------------------------------------------------------------------
-// Multikey quicksort on eight folded bytes at a time: the keys of a range
-// are compared as integers, and only a range whose keys tie moves on to the
-// next eight bytes.  Identifiers of a real ACL share long prefixes
-// ("user0001..."), which would make a plain comparison sort chase every
-// string through memory.
-
-struct skey {
-    uint64_t k;     // folded bytes [depth, depth + 8), big-endian, zero past the end
-    uint64_t next;  // the eight after, while the range's `nv` says so
-    uint32_t i;     // entry index
-};
-
-uint64_t chunk(const char *s, size_t len, size_t depth) {
-    if (depth >= len) return 0;
-    unsigned char b[8] = {};
-    size_t m = len - depth < 8 ? len - depth : 8;
-    std::memcpy(b, s + depth, m);
-    uint64_t v;
-    std::memcpy(&v, b, 8);
-    v = fold8(v);
-    std::memcpy(b, &v, 8);
-    uint64_t k = 0;
-    for (unsigned j = 0; j < 8; ++j) k = (k << 8) | b[j];
-    return k;
-}
-
-// A range of the key array whose entries share their first d bytes.
-struct rtask {
-    size_t lo, n;
-    unsigned d;
-};
-// Ranges this small sort faster by comparison than by another pass.
-constexpr size_t kRadixMin = 64;
-// Sixteen levels of at most 255 ranges waiting each, and the one at work.
-constexpr size_t kRadixStack = 16 * 255 + 1;
-
-struct sorter {
-    skey *a;
-    const ent *ents;
-    const char *arena;
-
-    // Sixteen bytes per load: most identifiers part within them, so a tied
-    // range usually moves on to its next eight bytes without going back to
-    // the arena (where, once partitioned, every access would be a miss).
-    void load(size_t lo, size_t n, size_t depth) {
-        for (size_t j = lo; j < lo + n; ++j) {
-            const ent &e = ents[a[j].i];
-            a[j].k = chunk(arena + e.id_off, e.id_len, depth);
-            a[j].next = chunk(arena + e.id_off, e.id_len, depth + 8);
-        }
-    }
-    // Move a tied range on to depth (8 further); true when `next` is again
-    // valid afterwards.
-    bool advance(size_t lo, size_t n, size_t depth, bool nv) {
-        if (!nv) {
-            load(lo, n, depth);
-            return true;
-        }
-        for (size_t j = lo; j < lo + n; ++j) a[j].k = a[j].next;
-        return false;
-    }
-    // Full order of two entries whose first `depth` folded bytes are equal
-    // and whose keys hold the next eight.
-    bool less(const skey &x, const skey &y, size_t depth, bool nv) const {
-        if (x.k != y.k) return x.k < y.k;
-        if (nv && x.next != y.next) return x.next < y.next;
-        const ent &ex = ents[x.i], &ey = ents[y.i];
-        size_t from = depth + 8;
-        const char *p = arena + ex.id_off, *q = arena + ey.id_off;
-        size_t lp = ex.id_len, lq = ey.id_len;
-        for (size_t j = from;; ++j) {
-            int cp = j < lp ? fold(static_cast<unsigned char>(p[j])) : -1;
-            int cq = j < lq ? fold(static_cast<unsigned char>(q[j])) : -1;
-            if (cp != cq) return cp < cq;
-            if (cp < 0) return x.i < y.i;  // equal texts: keep insertion order
-        }
-    }
-    void insertion(size_t lo, size_t n, size_t depth, bool nv) {
-        for (size_t j = lo + 1; j < lo + n; ++j) {
-            skey v = a[j];
-            size_t m = j;
-            while (m > lo && less(v, a[m - 1], depth, nv)) {
-                a[m] = a[m - 1];
-                --m;
-            }
-            a[m] = v;
-        }
-    }
-    // Fallback when partitioning stops making progress: O(n log n) always.
-    void heapsort(size_t lo, size_t n, size_t depth, bool nv) {
-        skey *h = a + lo;
-        auto sift = [&](size_t root, size_t end) {
-            for (;;) {
-                size_t c = 2 * root + 1;
-                if (c >= end) return;
-                if (c + 1 < end && less(h[c], h[c + 1], depth, nv)) ++c;
-                if (!less(h[root], h[c], depth, nv)) return;
-                std::swap(h[root], h[c]);
-                root = c;
-            }
-        };
-        for (size_t r = n / 2; r-- > 0;) sift(r, n);
-        for (size_t end = n; end-- > 1;) {
-            std::swap(h[0], h[end]);
-            sift(0, end);
-        }
-    }
-
-    // Multikey quicksort of [lo, lo + n), whose keys hold bytes 0 to 15.
-    void quicksort(size_t lo, size_t n) {
-        struct task {
-            size_t lo, n, depth;
-            unsigned budget;
-            bool nv;  // `next` holds the eight bytes after the key
-        };
-        // Continuing with the smallest piece and pushing the others keeps the
-        // stack within two entries per halving of the range: 2 * 32 + slack.
-        task stack[72];
-        size_t sp = 0;
-        unsigned budget0 = 2;
-        for (size_t m = n; m > 1; m >>= 1) budget0 += 2;
-        task cur{lo, n, 0, budget0, true};
-        for (;;) {
-            while (cur.n > 1) {
-                if (cur.n <= 16) {
-                    insertion(cur.lo, cur.n, cur.depth, cur.nv);
-                    break;
-                }
-                if (cur.budget == 0) {
-                    heapsort(cur.lo, cur.n, cur.depth, cur.nv);
-                    break;
-                }
-                uint64_t x = a[cur.lo].k, y = a[cur.lo + cur.n / 2].k, z = a[cur.lo + cur.n - 1].k;
-                uint64_t p = x < y ? (y < z ? y : (x < z ? z : x)) : (x < z ? x : (y < z ? z : y));
-                size_t lt = cur.lo, j = cur.lo, gt = cur.lo + cur.n;
-                while (j < gt) {
-                    if (a[j].k < p) std::swap(a[lt++], a[j++]);
-                    else if (a[j].k > p) std::swap(a[j], a[--gt]);
-                    else ++j;
-                }
-                task pieces[3] = {{cur.lo, lt - cur.lo, cur.depth, cur.budget - 1, cur.nv},
-                                  {lt, gt - lt, cur.depth + 8, budget0, false},
-                                  {gt, cur.lo + cur.n - gt, cur.depth, cur.budget - 1, cur.nv}};
-                // Keys that end inside this chunk are equal texts: done.  Else
-                // the tied range goes on with its next eight bytes.
-                if ((p & 0xff) == 0 || pieces[1].n < 2) {
-                    if ((p & 0xff) == 0 && pieces[1].n > 1)
-                        insertion(pieces[1].lo, pieces[1].n, cur.depth, cur.nv);
-                    pieces[1].n = 0;
-                } else {
-                    pieces[1].nv = advance(pieces[1].lo, pieces[1].n, pieces[1].depth, cur.nv);
-                }
-                int small = -1;
-                for (int q = 0; q < 3; ++q)
-                    if (pieces[q].n > 1 && (small < 0 || pieces[q].n < pieces[small].n)) small = q;
-                if (small < 0) break;
-                for (int q = 0; q < 3; ++q)
-                    if (q != small && pieces[q].n > 1) stack[sp++] = pieces[q];
-                cur = pieces[small];
-            }
-            if (sp == 0) break;
-            cur = stack[--sp];
-        }
-    }
-
-    // Byte d (0 to 15) of the key that `k` and `next` hold from depth 0.
-    static unsigned byte_at(const skey &x, unsigned d) {
-        const uint64_t w = d < 8 ? x.k : x.next;
-        return static_cast<unsigned>(w >> (56 - 8 * (d & 7))) & 0xff;
-    }
-
-    // Most significant byte first, in place (American flag sort): each pass
-    // moves a range's entries once into its buckets, where quicksort would
-    // move them once per halving.  Bytes every entry of a range shares are
-    // stepped over without moving anything.  Small ranges, and ranges tied
-    // through all sixteen bytes, go to quicksort, which begins at byte 0
-    // again: the keys are unchanged, so the order it makes is the same.
-    void sort(size_t n, rtask *stack) {
-        load(0, n, 0);
-        size_t sp = 0;
-        stack[sp++] = {0, n, 0};
-        size_t count[256], next[256];
-        while (sp) {
-            rtask t = stack[--sp];
-            for (;;) {
-                if (t.n <= kRadixMin || t.d >= 16) {
-                    quicksort(t.lo, t.n);
-                    break;
-                }
-                std::memset(count, 0, sizeof count);
-                for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(a[j], t.d)];
-                if (count[byte_at(a[t.lo], t.d)] == t.n) {
-                    ++t.d;
-                    continue;
-                }
-                size_t start[256];
-                for (size_t b = 0, at = t.lo; b < 256; ++b) {
-                    start[b] = next[b] = at;
-                    at += count[b];
-                }
-                for (unsigned b = 0; b < 256; ++b) {
-                    const size_t end = start[b] + count[b];
-                    while (next[b] < end) {
-                        skey v = a[next[b]];
-                        unsigned c = byte_at(v, t.d);
-                        while (c != b) {
-                            std::swap(v, a[next[c]++]);
-                            c = byte_at(v, t.d);
-                        }
-                        a[next[b]++] = v;
-                    }
-                }
-                // Bucket 0 holds identifiers that end here (none holds a
-                // NUL): equal texts, which quicksort leaves in insertion
-                // order.
-                if (count[0] > 1) quicksort(start[0], count[0]);
-                for (unsigned b = 1; b < 256; ++b)
-                    if (count[b] > 1) stack[sp++] = {start[b], count[b], t.d + 1};
-                break;
-            }
-        }
-    }
-};
 
 // Call f(index) for each present entry in order; f returns false to stop.
 template <class F>
@@ -438,18 +187,19 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
     size_t tail = 0;
     for (uint32_t i = sorted_upto; i < v.n; ++i)
         if (v.ents[i].flags & kPresent) ++tail;
-    skey *keys = nullptr;
+    acl__sort_key *keys = nullptr;
     if (tail) {
-        // The keys and, behind them, the radix pass's list of ranges.
-        if (tail > (SIZE_MAX - kRadixStack * sizeof(rtask)) / sizeof(skey)) return no_memory(fname, SIZE_MAX);
-        const size_t bytes = tail * sizeof(skey) + kRadixStack * sizeof(rtask);
-        keys = static_cast<skey *>(acl__malloc(bytes));
+        if (tail > acl__sort_max_keys()) return no_memory(fname, SIZE_MAX);
+        const size_t bytes = acl__sort_area_bytes(tail);
+        keys = static_cast<acl__sort_key *>(acl__malloc(bytes));
         if (!keys) return no_memory(fname, bytes);
         acl__advise_large(keys, bytes);
         size_t m = 0;
         for (uint32_t i = sorted_upto; i < v.n; ++i)
             if (v.ents[i].flags & kPresent) keys[m++].i = i;
-        sorter{keys, v.ents, v.arena}.sort(tail, reinterpret_cast<rtask *>(keys + tail));
+        static_assert(offsetof(ent, id_off) == 0 && offsetof(ent, id_len) == sizeof(uint32_t),
+                      "an entry's identifier offset and length lead it");
+        acl__sort_ids(keys, tail, {v.arena, v.ents, sizeof(ent)});
     }
     // The tail's entries and identifiers are reached in sorted order, which
     // is no order in memory: fetched ahead, the misses overlap instead of
@@ -480,27 +230,6 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
 
 // ---- Growing --------------------------------------------------------------------
 
-// Grow *p (elements of `size` bytes, capacity *cap) to hold `need`, doubling.
-bool grow_array(void **p, uint32_t *cap, size_t need, size_t size, size_t *failed) {
-    if (need <= *cap) return true;
-    size_t nc = *cap ? *cap : 4;
-    while (nc < need) nc = nc > SIZE_MAX / 2 ? SIZE_MAX : nc * 2;
-    if (nc > UINT32_MAX) nc = UINT32_MAX;
-    if (nc < need || nc > SIZE_MAX / size) {
-        *failed = SIZE_MAX;
-        return false;
-    }
-    void *q = acl__realloc(*p, nc * size);
-    if (!q) {
-        *failed = nc * size;
-        return false;
-    }
-    *p = q;
-    *cap = static_cast<uint32_t>(nc);
-    acl__advise_large(q, nc * size);
-    return true;
-}
-
 // The slot holding the identifier, or the free slot where it goes.
 size_t find_slot(const big_part *b, uint32_t h, const char *id, size_t idlen, bool *found) {
     size_t s = slot_of(h, b->idx_mask);
@@ -521,7 +250,10 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
     size_t slots = size_t{b->idx_mask} + 1;
     if (b->idx && need <= slots / 2) return true;
     size_t ns = b->idx ? slots : 8;
-    while (ns / 2 < need) ns *= 2;
+    // Quadrupling: every rebuild rehashes every identifier into pages that
+    // have never been touched, so fewer rebuilds cost less than the unused
+    // slots do.
+    while (ns / 2 < need) ns *= 4;
     if (ns > (size_t{1} << 31)) {
         *failed = SIZE_MAX;
         return false;
@@ -582,11 +314,12 @@ int32_t promote(tree **node, size_t more, size_t bytes) {
     const size_t keep = t->mechlen + 1u;
     size_t failed = 0;
     big_part nb{};
-    bool ok = grow_array(reinterpret_cast<void **>(&nb.ents), &nb.cap, more >= UINT32_MAX ? UINT32_MAX : 1 + more,
-                         sizeof(ent), &failed);
-    size_t want = inl + bytes < 64 ? 64 : inl + bytes;
-    if (ok) ok = grow_array(reinterpret_cast<void **>(&nb.arena), &nb.arena_cap,
-                            want > UINT32_MAX ? UINT32_MAX : want, 1, &failed);
+    // A tree that grows past one entry usually grows further: start with
+    // room for several, so a small tree is not reallocated at every step.
+    bool ok = acl__grow(&nb.ents, &nb.cap, more >= UINT32_MAX ? UINT32_MAX : (more < 7 ? 8 : 1 + more), &failed);
+    size_t want = inl + bytes < 256 ? 256 : inl + bytes;
+    if (ok) ok = acl__grow(&nb.arena, &nb.arena_cap,
+                            want > UINT32_MAX ? UINT32_MAX : want, &failed);
     tree *nt = nullptr;
     if (ok) {
         std::memcpy(nb.arena, inline_bytes(t), inl);
@@ -623,19 +356,13 @@ const char *type_name(unsigned t) {
     }
 }
 
-struct new_entry {
-    unsigned char type;
-    uint32_t perm;
-    const char *mech;  // NUL-terminated at mechlen ("" for types without one)
-    size_t mechlen;
-    const char *id;    // NUL-terminated at idlen ("" for types without one)
-    size_t idlen;
-    // Hashed only when an index is consulted.
-    mutable uint32_t hash = 0;
-    mutable bool hashed = false;
+// An entry to insert, its identifier's hash taken only when an index is
+// consulted.
+struct new_entry : acl__entry_parts {
+    explicit new_entry(const acl__entry_parts &p) : acl__entry_parts(p) {}
     uint32_t h() const {
-        if (!hashed) hash = fold_hash(id, idlen) & kHashMask, hashed = true;
-        return hash;
+        if (!hashed) idhash = acl__id_hash(id, idlen), hashed = true;
+        return idhash;
     }
 };
 
@@ -644,9 +371,9 @@ int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
     if (single) {
         switch (ne.type) {
         case SEC_ACLE_TYPE_UNAUTHENTICATED:
-        case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, 160, letter);
-        case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, 161, letter, ne.id);
-        default: return acl::set_error(ACL_RC_BAD_ACLE, 144, letter, ne.mech, ne.id);
+        case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_SINGLE_ACLE, letter);
+        case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_GROUP, letter, ne.id);
+        default: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_ACLE, letter, ne.mech, ne.id);
         }
     }
     stored.perm = ne.perm;
@@ -723,7 +450,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     if (!t) return create(ne, node);
     if (t->type != ne.type || (has_mech(t->type) && (ne.mechlen != t->mechlen ||
                                                      !fold_eq(inline_bytes(t), ne.mech, ne.mechlen))))
-        return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, ne.type);
+        return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, ne.type);
 
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
@@ -763,9 +490,8 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     const bool own = has_mech(t->type) && std::memcmp(ne.mech, inline_bytes(t), t->mechlen) != 0;
     const size_t add = (own ? t->mechlen + 1 : 0) + ne.idlen + 1;
     if (i == UINT32_MAX || add > UINT32_MAX - size_t{b->arena_len}) return no_memory(fname, SIZE_MAX);
-    if (!grow_array(reinterpret_cast<void **>(&b->ents), &b->cap, size_t{i} + 1, sizeof(ent), &failed) ||
-        !grow_array(reinterpret_cast<void **>(&b->arena), &b->arena_cap, size_t{b->arena_len} + add, 1,
-                    &failed))
+    if (!acl__grow(&b->ents, &b->cap, size_t{i} + 1, &failed) ||
+        !acl__grow(&b->arena, &b->arena_cap, size_t{b->arena_len} + add, &failed))
         return no_memory(fname, failed);
     if (b->idx && !found) {
         uint64_t *old = b->idx;
@@ -797,115 +523,79 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     return 0;
 }
 
-bool entry_parts(const sec_acle_desc *acle, new_entry *ne) {
-    ne->type = acle->type;
-    ne->perm = acle->perm;
+
+}  // namespace
+
+// ---- Public operations ------------------------------------------------------------
+
+int32_t sec__add_acle_to_tree(sec_boolean_t single, const sec_acle_desc *acle, sec_acltree_t *node) {
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__add_acle_to_tree", 2, 0);
+    if (!node) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__add_acle_to_tree", 3, 0);
+    acl__entry_parts parts;
+    if (!acl__entry_parts_of(acle, &parts)) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::BAD_ACLE_TYPE, acle->type);
+    return insert(single, new_entry(parts), node);
+}
+
+bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts) {
+    *parts = acl__entry_parts{};
+    parts->type = acle->type;
+    parts->perm = acle->perm;
     // The record's mechanism is a 17-byte field; one without its NUL is
     // taken as its first 16 characters rather than read past.
-    ne->mech = has_mech(acle->type) ? acle->mech : "";
-    ne->mechlen = has_mech(acle->type) ? strnlen(acle->mech, kMechMax) : 0;
+    parts->mech = has_mech(acle->type) ? acle->mech : "";
+    parts->mechlen = has_mech(acle->type) ? strnlen(acle->mech, kMechMax) : 0;
     // A record of a type with an identifier but none given is taken as an
     // empty identifier; the types without one drop any they carry.
-    ne->id = has_id(acle->type) && acle->id ? acle->id : "";
-    ne->idlen = std::strlen(ne->id);
+    parts->id = has_id(acle->type) && acle->id ? acle->id : "";
+    parts->idlen = std::strlen(parts->id);
     return acl__valid_type(acle->type);
 }
 
-// ---- The array of trees ---------------------------------------------------------
-
-struct trees_index {
-    uint64_t *slots;  // key hash (upper half), tree slot + 1 (lower half); 0 free
-    uint32_t mask;
-    uint32_t used;
-    size_t cap;   // capacity of the trees array
-    int32_t last; // slot of the previous insertion, checked first
-};
-
-uint32_t tree_key_hash(unsigned char type, const char *mech, size_t mechlen) {
-    return fold_hash(mech, mechlen, type);
+int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts) {
+    return insert(single, new_entry(parts), node);
 }
 
-bool tree_matches(const tree *t, unsigned char type, const char *mech, size_t mechlen) {
+bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mech, size_t mechlen) {
     if (!t || t->type != type) return false;
     if (!has_mech(type)) return true;
     return t->mechlen == mechlen && fold_eq(inline_bytes(t), mech, mechlen);
 }
 
-void index_put(trees_index *x, uint64_t v) {
-    size_t s = slot_of(slot_hash(v), x->mask);
-    while (x->slots[s]) s = (s + 1) & x->mask;
-    x->slots[s] = v;
-}
+const size_t acl__tree_head_bytes = sizeof(tree) + sizeof(big_part) + kMechMax + 1;
 
-// Make the index hold every tree of the array plus `more`, at most half
-// full.
-int32_t index_room(trees_index *x, acl__trees_s *trees, size_t more) {
-    size_t slots = x->slots ? size_t{x->mask} + 1 : 0;
-    size_t need = size_t{x->used} + more;
-    if (x->slots && need <= slots / 2) return 0;
-    if (!x->slots) need = static_cast<size_t>(trees->nooftrees) + more;
-    size_t ns = slots ? slots : 16;
-    while (ns / 2 < need) ns *= 2;
-    auto *nsl = static_cast<uint64_t *>(acl__calloc(ns, sizeof(uint64_t)));
-    if (!nsl) return no_memory("sec__add_acle_to_trees", ns * sizeof(uint64_t));
-    acl__advise_large(nsl, ns * sizeof(uint64_t));
-    uint64_t *old = x->slots;
-    x->slots = nsl;
-    x->mask = static_cast<uint32_t>(ns - 1);
-    if (old) {
-        for (size_t s = 0; s < slots; ++s)
-            if (old[s]) index_put(x, old[s]);
-        std::free(old);
-        return 0;
+uint32_t acl__id_hash(const char *id, size_t idlen) { return fold_hash(id, idlen) & kHashMask; }
+
+void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
+    if (!t || !t->big) return;  // a one-entry tree is its own block
+    const big_part *b = t->big;
+    if (b->idx) {
+        __builtin_prefetch(&b->idx[slot_of(idhash, b->idx_mask)]);
+    } else if (b->n <= kScanMax) {
+        // A small tree scans its entries.
+        const char *e = reinterpret_cast<const char *>(b->ents);
+        for (size_t off = 0; off < size_t{b->n} * sizeof(ent); off += 64) __builtin_prefetch(e + off);
+    } else if (b->n > 0) {
+        // An ordered one compares with its last entry only.
+        __builtin_prefetch(&b->ents[b->n - 1]);
     }
-    x->used = 0;
-    for (int32_t s = 0; s < trees->nooftrees; ++s)
-        if (const tree *t = trees->trees[s]) {
-            index_put(x, slot_value(tree_key_hash(t->type, inline_bytes(t), t->mechlen), static_cast<uint32_t>(s)));
-            ++x->used;
-        }
-    return 0;
+    __builtin_prefetch(b->ents + b->n, 1);
+    __builtin_prefetch(b->arena + b->arena_len, 1);
 }
 
-}  // namespace
-
-void acl__advise_large(void *p, size_t n) {
-#ifdef MADV_HUGEPAGE
-    // Arrays of a million entries are walked and probed at random: with 4 KiB
-    // pages nearly every access is a TLB miss and every fresh page a fault.
-    // Only whole 2 MiB stretches inside the block are advised; the advice
-    // changes no content and a refusal is harmless.
-    constexpr uintptr_t kHuge = uintptr_t{2} << 20;
-    if (!p || n < 2 * kHuge) return;
-    uintptr_t a = (reinterpret_cast<uintptr_t>(p) + kHuge - 1) & ~(kHuge - 1);
-    uintptr_t e = (reinterpret_cast<uintptr_t>(p) + n) & ~(kHuge - 1);
-    if (e > a) madvise(reinterpret_cast<void *>(a), e - a, MADV_HUGEPAGE);
-#else
-    (void)p;
-    (void)n;
-#endif
-}
-
-// ---- Public operations ------------------------------------------------------------
-
-int32_t sec__add_acle_to_tree(sec_boolean_t single, const sec_acle_desc *acle, sec_acltree_t *node) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__add_acle_to_tree", 2, 0);
-    if (!node) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__add_acle_to_tree", 3, 0);
-    new_entry ne;
-    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, 103, acle->type);
-    return insert(single, ne, node);
+uint32_t acl__tree_key_hash(const sec_acltree_s *t) {
+    return acl__subacl_key_hash(t->type, inline_bytes(t), t->mechlen);
 }
 
 int32_t acl__tree_insert(sec_acltree_t *node, sec_boolean_t single, unsigned char type, uint32_t perm,
                          const char *mech, size_t mechlen, const char *id, size_t idlen) {
-    new_entry ne;
-    ne.type = type;
-    ne.perm = perm;
-    ne.mech = has_mech(type) ? mech : "";
-    ne.mechlen = has_mech(type) ? mechlen : 0;
-    ne.id = has_id(type) ? id : "";
-    ne.idlen = has_id(type) ? idlen : 0;
-    return insert(single, ne, node);
+    acl__entry_parts parts;
+    parts.type = type;
+    parts.perm = perm;
+    parts.mech = has_mech(type) ? mech : "";
+    parts.mechlen = has_mech(type) ? mechlen : 0;
+    parts.id = has_id(type) ? id : "";
+    parts.idlen = has_id(type) ? idlen : 0;
+    return insert(single, new_entry(parts), node);
 }
 
 int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
@@ -917,94 +607,20 @@ int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
     size_t ne = size_t{b->n} + entries, nb = size_t{b->arena_len} + bytes;
     if (ne > UINT32_MAX) ne = UINT32_MAX;
     if (nb > UINT32_MAX) nb = UINT32_MAX;
-    if (!grow_array(reinterpret_cast<void **>(&b->ents), &b->cap, ne, sizeof(ent), &failed) ||
-        !grow_array(reinterpret_cast<void **>(&b->arena), &b->arena_cap, nb, 1, &failed) ||
+    if (!acl__grow(&b->ents, &b->cap, ne, &failed) ||
+        !acl__grow(&b->arena, &b->arena_cap, nb, &failed) ||
         (b->idx && !grow_index(b, size_t{b->idx_used} + entries, &failed)))
         return no_memory("sec__add_acle_to_tree", failed);
     return 0;
 }
 
-int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
-    const char *fname = "sec__add_acle_to_trees";
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 1, 0);
-    if (!trees) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
-    new_entry ne;
-    if (!entry_parts(acle, &ne)) return acl::set_error(ACL_RC_BAD_ACLE, 103, acle->type);
-
-    auto *x = static_cast<trees_index *>(trees->index);
-    if (!x) {
-        x = static_cast<trees_index *>(acl__calloc(1, sizeof(trees_index)));
-        if (!x) return no_memory(fname, sizeof(trees_index));
-        x->cap = static_cast<size_t>(trees->nooftrees);  // an array handed in holds exactly its count
-        x->last = -1;
-        trees->index = x;
-    }
-    if (x->last >= 0 && x->last < trees->nooftrees &&
-        tree_matches(trees->trees[x->last], ne.type, ne.mech, ne.mechlen))
-        return insert(1, ne, &trees->trees[x->last]);
-    // Index every tree before the first search (the array may have been
-    // handed in already filled).
-    if (!x->slots && trees->nooftrees > 0)
-        if (int32_t rc = index_room(x, trees, 0)) return rc;
-
-    const uint32_t h = tree_key_hash(ne.type, ne.mech, ne.mechlen);
-    if (x->slots) {
-        for (size_t s = slot_of(h, x->mask); x->slots[s]; s = (s + 1) & x->mask) {
-            if (slot_hash(x->slots[s]) != h) continue;
-            int32_t slot = static_cast<int32_t>(slot_entry(x->slots[s]));
-            if (tree_matches(trees->trees[slot], ne.type, ne.mech, ne.mechlen)) {
-                x->last = slot;
-                return insert(1, ne, &trees->trees[slot]);
-            }
-        }
-    }
-
-    // A new sub-ACL: grow the index and the array first, so a failure
-    // leaves both as they were.
-    if (trees->nooftrees == INT32_MAX) return no_memory(fname, SIZE_MAX);
-    if (int32_t rc = index_room(x, trees, 1)) return rc;
-    if (static_cast<size_t>(trees->nooftrees) == x->cap) {
-        size_t nc = x->cap ? x->cap * 2 : 4;
-        if (nc > INT32_MAX) nc = INT32_MAX;
-        void *na = acl__realloc(trees->trees, nc * sizeof(sec_acltree_t));
-        if (!na) return no_memory(fname, nc * sizeof(sec_acltree_t));
-        trees->trees = static_cast<sec_acltree_t *>(na);
-        x->cap = nc;
-        acl__advise_large(na, nc * sizeof(sec_acltree_t));
-    }
-    const int32_t slot = trees->nooftrees++;
-    trees->trees[slot] = nullptr;
-    // When the first entry cannot be stored the slot stays, counted and
-    // empty, and out of the index.
-    int32_t rc = insert(1, ne, &trees->trees[slot]);
-    if (rc) return rc;
-    index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
-    ++x->used;
-    x->last = slot;
-    return 0;
-}
-
-void acl__free_trees(acl__trees_s *trees) {
-    if (!trees) return;
-    while (trees->nooftrees > 0) {
-        --trees->nooftrees;
-        sec__free_acltree(trees->trees[trees->nooftrees]);
-    }
-    std::free(trees->trees);
-    if (auto *x = static_cast<trees_index *>(trees->index)) {
-        std::free(x->slots);
-        std::free(x);
-    }
-    trees->trees = nullptr;
-    trees->index = nullptr;
-}
-
 int32_t sec__del_acle_from_tree(const sec_acle_desc *acle, sec_acltree_t t) {
-    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, 88, "sec__del_acle_from_tree", 1, 0);
-    new_entry ne;
-    entry_parts(acle, &ne);
+    if (!acle) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "sec__del_acle_from_tree", 1, 0);
+    acl__entry_parts parts;
+    acl__entry_parts_of(acle, &parts);
+    const new_entry ne(parts);
     auto not_found = [&] {
-        return acl::set_error(ACL_RC_NO_MATCH, 105, acle->type, has_mech(acle->type) ? ne.mech : "",
+        return acl::set_error(ACL_RC_NO_MATCH, acl::msg::ACLE_NOT_IN_ACL, acle->type, has_mech(acle->type) ? ne.mech : "",
                               has_id(acle->type) ? ne.id : "");
     };
     // The given entry must be of the tree's type; its mechanism is not
@@ -1049,7 +665,7 @@ void sec__free_acltree(sec_acltree_t t) {
 
 int32_t sec__acltree_to_aclelist(sec_acltree_t t, sec_acle_list_t list) {
     const char *fname = "sec__acltree_to_aclelist";
-    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, 88, fname, 2, 0);
+    if (!list) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, 0);
     const uint32_t n = t ? present_count(t) : 0;
     if (n == 0) return 0;
     // Room for every entry at once: one reallocation per tree, not one per

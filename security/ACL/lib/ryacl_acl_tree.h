@@ -3,17 +3,27 @@
 // be laid down in order: ascending case-insensitive identifier for user and
 // group entries, insertion order for expanded entries.
 //
-// A tree is an opaque object reached through sec_acltree_t (null while
-// empty).  Inserting and finding a duplicate cost O(1) whatever the order
-// of the input (deleting at most O(log n)), and nothing recurses.
+// The names say "tree" because that is what every caller knows them as;
+// none of them is one.  A tree is an opaque object reached through
+// sec_acltree_t (null while empty): its entries in arrival order in one
+// array, their identifiers in one byte arena, and, once it grows past a
+// few entries in no order, a hash index on the folded identifier
+// (ryacl_acl_tree.cpp).  A search tree costs a comparison per level and,
+// fed a sorted file, becomes a chain as deep as the file is long; the
+// hashed arena finds a duplicate in O(1) whatever the input order, never
+// recurses, and the order the writer needs is made once, when the entries
+// are visited (ryacl_acl_sort.h).  The array of trees of an ACL under
+// construction (acl__trees_s) is ryacl_acl_trees.cpp.
 #pragma once
 
 #include <cstddef>
 #include <cstdint>
 
+#include "ry_zo_int.h"
 #include "ryacl.h"
 
 struct sec_acltree_s;
+struct acl__entry_parts;
 typedef sec_acltree_s *sec_acltree_t;
 
 // The growable array of trees of an ACL under construction, one slot per
@@ -28,6 +38,15 @@ struct acl__trees_s {
 // Find or append the tree of the entry's sub-ACL and insert a copy of the
 // entry, refusing a duplicate (43 with message 160, 144 or 161).
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees);
+// Entries about to be added, in the order they will be: taken apart into
+// parts[0, n) and hashed, and what adding each will touch fetched into
+// cache, so that the misses of a batch overlap instead of coming one after
+// another.  Changes no tree.  False when an entry's type is none of the
+// five (parts from it on are not filled).
+bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
+                         acl__entry_parts *parts);
+// sec__add_acle_to_trees of an entry as parts (its hash kept).
+int32_t acl__add_parts_to_trees(const acl__entry_parts &parts, acl__trees_s *trees);
 // Release every tree (the last first) and the array; leaves it empty.
 void acl__free_trees(acl__trees_s *trees);
 
@@ -79,6 +98,52 @@ int32_t acl__tree_reserve(sec_acltree_t *tree, size_t entries, size_t bytes);
 // their identifier lengths and the longest one.
 void acl__tree_stats(const sec_acltree_s *tree, size_t *count, uint64_t *id_bytes, size_t *max_idlen);
 
-// Advise the kernel that a large block is worth backing with huge pages
-// (no effect on small blocks or where unsupported).
-void acl__advise_large(void *p, size_t n);
+// ---- Shared by the tree and the array of trees ---------------------------
+
+// An entry as parts: mech NUL-terminated at mechlen and id at idlen, both
+// "" for the types without them.
+struct acl__entry_parts {
+    unsigned char type;
+    uint32_t perm;
+    const char *mech;
+    size_t mechlen;
+    const char *id;
+    size_t idlen;
+    // The identifier's hash (acl__id_hash), once taken.
+    mutable uint32_t idhash = 0;
+    mutable bool hashed = false;
+    // The slot of its tree in the array of trees, once found (a slot keeps
+    // its tree for good).
+    int32_t tree_slot = -1;
+};
+// The hash the trees index an identifier by.
+uint32_t acl__id_hash(const char *id, size_t idlen);
+// Fetch into cache what inserting an identifier of that hash into the tree
+// will touch; changes nothing.
+void acl__tree_prefetch(const sec_acltree_s *tree, uint32_t idhash);
+// The parts of an entry record; false for a type that is none of the five.
+bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts);
+// acl__tree_insert with the entry as parts.
+int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts);
+// Whether the tree is that of sub-ACL (type, mechanism): the key it was
+// created with, the mechanism compared case-insensitively.
+bool acl__tree_holds(const sec_acltree_s *tree, unsigned char type, const char *mech, size_t mechlen);
+// The hash of a sub-ACL key, and that of the key a tree was created with.
+inline uint32_t acl__subacl_key_hash(unsigned char type, const char *mech, size_t mechlen) {
+    return zo::fold_hash(mech, mechlen, type);
+}
+uint32_t acl__tree_key_hash(const sec_acltree_s *tree);
+// Bytes from a tree's start that finding it reads (its header and the
+// first entry's mechanism), for fetching ahead.
+extern const size_t acl__tree_head_bytes;
+
+// A slot of either hash index: a key's hash in the upper half, the number
+// of what it finds (entry or tree slot) + 1 in the lower; 0 is free.  The
+// two low bits of the hash are not used for the home slot, so a hash with
+// flags in them (the tree's entries keep two there) still spreads.
+namespace acl__slot {
+inline size_t slot_of(uint32_t h, uint32_t mask) { return (h >> 2) & mask; }
+inline uint64_t slot_value(uint32_t h, uint32_t i) { return (uint64_t{h} << 32) | (uint64_t{i} + 1); }
+inline uint32_t slot_hash(uint64_t v) { return static_cast<uint32_t>(v >> 32); }
+inline uint32_t slot_entry(uint64_t v) { return static_cast<uint32_t>(v) - 1; }
+}  // namespace acl__slot

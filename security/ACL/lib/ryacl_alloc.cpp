@@ -1,9 +1,16 @@
 // The library's one allocation path (see ryacl_alloc.h).
 #include "ryacl_alloc.h"
 
+#include <sys/mman.h>
+
 #include <atomic>
+#include <climits>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
+
+#include "ryacl.h"
+#include "ryacl_error.h"
 
 namespace {
 std::atomic<acl__alloc_hook_t> g_hook{nullptr};
@@ -42,3 +49,31 @@ char *acl__strndup(const char *s, size_t n) {
 }
 
 char *acl__strdup(const char *s) { return acl__strndup(s, SIZE_MAX); }
+
+int32_t acl__no_memory(const char *fn, size_t n) {
+    const int32_t size = n > INT32_MAX ? INT32_MAX : static_cast<int32_t>(n);
+    return acl::set_error(ACL_RC_NO_MEMORY, acl::msg::NO_MEMORY, fn, size);
+}
+
+void *acl__malloc_or_record(const char *fn, size_t n) {
+    void *p = acl__malloc(n);
+    if (!p) acl__no_memory(fn, n);
+    return p;
+}
+
+void acl__advise_large(void *p, size_t n) {
+#ifdef MADV_HUGEPAGE
+    // Arrays of a million entries are walked and probed at random: with 4 KiB
+    // pages nearly every access is a TLB miss and every fresh page a fault.
+    // Only whole 2 MiB stretches inside the block are advised; the advice
+    // changes no content and a refusal is harmless.
+    constexpr uintptr_t kHuge = uintptr_t{2} << 20;
+    if (!p || n < 2 * kHuge) return;
+    uintptr_t a = (reinterpret_cast<uintptr_t>(p) + kHuge - 1) & ~(kHuge - 1);
+    uintptr_t e = (reinterpret_cast<uintptr_t>(p) + n) & ~(kHuge - 1);
+    if (e > a) madvise(reinterpret_cast<void *>(a), e - a, MADV_HUGEPAGE);
+#else
+    (void)p;
+    (void)n;
+#endif
+}

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 
 void *acl__malloc(size_t n);
 void *acl__calloc(size_t count, size_t size);
@@ -10,8 +11,44 @@ void *acl__realloc(void *p, size_t n);
 char *acl__strdup(const char *s);
 char *acl__strndup(const char *s, size_t n);
 
+// Record that `fn` could not allocate n bytes: ACL_RC_NO_MEMORY with message
+// 89 (NO_MEMORY), n capped at INT32_MAX as the message's number holds no
+// more.  Returns ACL_RC_NO_MEMORY, for `return acl__no_memory(...)`.
+int32_t acl__no_memory(const char *fn, size_t n);
+// n bytes through acl__malloc; on failure acl__no_memory(fn, n) and null.
+void *acl__malloc_or_record(const char *fn, size_t n);
+
 // Test seam: when set, every allocation first asks the hook; a false answer
 // makes that allocation fail.  Null restores plain allocation.  Not exported
 // from the shared library; tests link the static one.
 typedef bool (*acl__alloc_hook_t)(size_t n);
 void acl__set_alloc_hook(acl__alloc_hook_t hook);
+
+// Advise the kernel that a large block is worth backing with huge pages
+// (no effect on small blocks or where unsupported).
+void acl__advise_large(void *p, size_t n);
+
+// Grow the array *p of capacity *cap to hold `need` elements, doubling, the
+// capacity staying within 32 bits.  False when that cannot be had: *failed
+// is then the size that could not be allocated (SIZE_MAX for one beyond
+// reach) and the array is unchanged.
+template <class T>
+bool acl__grow(T **p, uint32_t *cap, size_t need, size_t *failed) {
+    if (need <= *cap) return true;
+    size_t nc = *cap ? *cap : 4;
+    while (nc < need) nc = nc > SIZE_MAX / 2 ? SIZE_MAX : nc * 2;
+    if (nc > UINT32_MAX) nc = UINT32_MAX;
+    if (nc < need || nc > SIZE_MAX / sizeof(T)) {
+        *failed = SIZE_MAX;
+        return false;
+    }
+    void *q = acl__realloc(*p, nc * sizeof(T));
+    if (!q) {
+        *failed = nc * sizeof(T);
+        return false;
+    }
+    *p = static_cast<T *>(q);
+    *cap = static_cast<uint32_t>(nc);
+    acl__advise_large(q, nc * sizeof(T));
+    return true;
+}

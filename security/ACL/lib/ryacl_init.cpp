@@ -57,13 +57,13 @@ int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_han
     int32_t rc = 0;
     size_t mlen = 0;
     if (type != SEC_ID_HANDLER_EXPANDED && type != SEC_ID_HANDLER_USER)
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__register_id_handler", 1, type);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__register_id_handler", 1, type);
     else if (!mech)
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__register_id_handler", 2, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__register_id_handler", 2, 0);
     else if (!handler)
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__register_id_handler", 3, 0);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__register_id_handler", 3, 0);
     else if ((mlen = strnlen(mech, 17)) == 0 || mlen > 16)
-        rc = acl::set_error(ACL_RC_BAD_ARGS, 119);
+        rc = acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_MECH);
     if (rc) {
         acl::trace::api_exit(77, 78, rc);
         return rc;
@@ -71,7 +71,7 @@ int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_han
 
     int lrc = pthread_mutex_lock(&acl__state.mutex);
     if (lrc) {
-        rc = acl::set_error(ACL_RC_INTERNAL, 118, ACL_LOC_ACL, lrc);
+        rc = acl::set_error(ACL_RC_INTERNAL, acl::msg::LOCK_FAILURE, ACL_LOC_ACL, lrc);
         acl::trace::api_exit(77, 78, rc);
         return rc;
     }
@@ -80,7 +80,7 @@ int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_han
     acl__id_handler_s *slots = acl__state.id_handlers.load(std::memory_order_relaxed);
     if (count == INT32_MAX) {
         // The count is a signed 32-bit value; nothing else bounds it.
-        rc = acl::set_error(ACL_RC_NO_MEMORY, 89, "acl__register_id_handler", INT32_MAX);
+        rc = acl__no_memory("acl__register_id_handler", INT32_MAX);
     } else if (count == acl__state.capacity) {
         // Double the block so a run of registrations costs linear time and
         // memory; the new block is complete before it is published.
@@ -88,7 +88,7 @@ int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_han
         size_t bytes = sizeof(handler_block) + static_cast<size_t>(cap) * sizeof(acl__id_handler_s);
         void *mem = acl__malloc(bytes);
         if (!mem) {
-            rc = acl::set_error(ACL_RC_NO_MEMORY, 89, "acl__register_id_handler", bytes);
+            rc = acl__no_memory("acl__register_id_handler", bytes);
         } else {
             handler_block *blk = new (mem) handler_block{block_of(slots), cap};
             acl__id_handler_s *fresh = blk->slots();
@@ -110,7 +110,7 @@ int32_t sec__register_id_handler(uint32_t type, const char *mech, sec_acl_id_han
     }
 
     int urc = pthread_mutex_unlock(&acl__state.mutex);
-    if (urc) rc = acl::set_error(ACL_RC_INTERNAL, 118, ACL_LOC_ACL, urc);
+    if (urc) rc = acl::set_error(ACL_RC_INTERNAL, acl::msg::LOCK_FAILURE, ACL_LOC_ACL, urc);
     acl::trace::api_exit(77, 78, rc);
     return rc;
 }

@@ -3,11 +3,13 @@
 #include <langinfo.h>
 #include <pthread.h>
 
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 
 #include "ry_zo_int.h"
 #include "ryacl.h"
+#include "ryacl_alloc.h"
 #include "ryacl_error.h"
 #include "ryacl_utils.h"
 #include "ryacl_utils_codeset.h"
@@ -29,11 +31,11 @@ struct source_loc {
 };
 
 // Codeset names forced by tests, per direction (0 to UTF-8, 1 from UTF-8).
-const char *g_codeset_override[2] = {nullptr, nullptr};
+std::atomic<const char *> g_codeset_override[2] = {nullptr, nullptr};
 
 void open_handle(uint32_t flags, zo_iconv_t *handle) {
     char codeset[256] = {};
-    const char *forced = g_codeset_override[(flags & ZO_ICONV_FROM_UTF8) ? 1 : 0];
+    const char *forced = g_codeset_override[(flags & ZO_ICONV_FROM_UTF8) ? 1 : 0].load(std::memory_order_acquire);
     if (forced) {
         std::snprintf(codeset, sizeof codeset, "%s", forced);
     } else if (zo_utf8_is_assumed_1()) {
@@ -51,7 +53,7 @@ void open_handle(uint32_t flags, zo_iconv_t *handle) {
 
 int32_t convert(zo_iconv_t handle, const char *fn, const char *in, size_t *inlen, char **out, size_t *outlen,
                 size_t *utf8_length) {
-    if (!handle) return acl::set_error(ACL_RC_CODESET, 129);
+    if (!handle) return acl::set_error(ACL_RC_CODESET, acl::msg::CODESET_INIT);
     // The location names the conversion call itself, so it is taken on its line.
     const source_loc at{ACL_LOC_UTILS}; const int zrc = zo_iconv_str_1(handle, 0, in, inlen, out, outlen);
     switch (zrc) {
@@ -59,17 +61,17 @@ int32_t convert(zo_iconv_t handle, const char *fn, const char *in, size_t *inlen
         return ACL_RC_OK;
     case ZO_ICONV_RC_BAD_HANDLE:
     case ZO_ICONV_RC_BAD_ARGS:
-        return acl::set_error(ACL_RC_INTERNAL, 91, at.file, at.line, zrc);
+        return acl::set_error(ACL_RC_INTERNAL, acl::msg::INTERNAL, at.file, at.line, zrc);
     case ZO_ICONV_RC_NO_MEMORY: {
         // For the direction to UTF-8 the converter has put the size it
         // could not allocate into the output length; the caller gets its
         // output length back as it gave it.
         const size_t attempted = utf8_length ? *utf8_length : 0;
         *outlen = 0;
-        return acl::set_error(ACL_RC_NO_MEMORY, 89, fn, attempted);
+        return acl__no_memory(fn, attempted);
     }
     default:
-        return acl::set_error(ACL_RC_CODESET, 130);
+        return acl::set_error(ACL_RC_CODESET, acl::msg::CODESET_CONVERT);
     }
 }
 
@@ -79,7 +81,7 @@ void acl__init_to_utf8_handle(void) { open_handle(0, &acl__to_utf8_hdl); }
 void acl__init_from_utf8_handle(void) { open_handle(ZO_ICONV_FROM_UTF8, &acl__from_utf8_hdl); }
 
 void acl__set_codeset_for_test(bool from_utf8, const char *codeset) {
-    g_codeset_override[from_utf8 ? 1 : 0] = codeset;
+    g_codeset_override[from_utf8 ? 1 : 0].store(codeset, std::memory_order_release);
 }
 
 int32_t acl__convert_to_utf8(const char *local_string, size_t *local_length, char **utf8_string,

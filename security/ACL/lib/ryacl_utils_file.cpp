@@ -33,27 +33,27 @@ int32_t read_whole(const char *aclfname, int aclfdes, char **aclfbuf, size_t *ac
     if (fstat(aclfdes, &st) != 0) {
         int err = errno;
         tr::point(tr::INFO, 123, {tr::str(name), tr::val(err)});
-        return acl::set_error(ACL_RC_FILE_ERROR, 122, name, err);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, name, err);
     }
     // A FIFO or device has no size to read up to, and a directory no
     // contents; the lookup itself succeeded, so there is no errno to give.
     if (!S_ISREG(st.st_mode)) {
         int err = 0;
         tr::point(tr::INFO, 123, {tr::str(name), tr::val(err)});
-        return acl::set_error(ACL_RC_FILE_ERROR, 122, name, err);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::BAD_FILE, name, err);
     }
     if (st.st_size == 0) return 0;
 
     uint64_t size = static_cast<uint64_t>(st.st_size);
     if (size >= SIZE_MAX) {
         tr::point(tr::INFO, 125, {tr::str(name), tr::val(size)});
-        return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_read_acl_file", size);
+        return acl__no_memory("sec_read_acl_file", size);
     }
     size_t want = static_cast<size_t>(size);
     char *buf = static_cast<char *>(acl__malloc(want + 1));
     if (!buf) {
         tr::point(tr::INFO, 125, {tr::str(name), tr::val(size)});
-        return acl::set_error(ACL_RC_NO_MEMORY, 89, "sec_read_acl_file", want + 1);
+        return acl__no_memory("sec_read_acl_file", want + 1);
     }
 
     // read() may return less than asked on any file system; go on until the
@@ -76,7 +76,7 @@ int32_t read_whole(const char *aclfname, int aclfdes, char **aclfbuf, size_t *ac
         uint64_t count = got;
         tr::point(tr::INFO, 127, {tr::str(name), tr::val(size), tr::val(count)});
         std::free(buf);
-        return acl::set_error(ACL_RC_FILE_ERROR, 126, got, want, err);
+        return acl::set_error(ACL_RC_FILE_ERROR, acl::msg::FILE_READ, got, want, err);
     }
     buf[want] = '\0';
     *aclfbuf = buf;
@@ -87,8 +87,8 @@ int32_t read_whole(const char *aclfname, int aclfdes, char **aclfbuf, size_t *ac
 }  // namespace
 
 int32_t acl__read_acl_file(const char *aclfname, int aclfdes, char **aclfbuf, size_t *aclfsize) {
-    if (!aclfbuf) return acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__read_acl_file", 3, 0);
-    if (!aclfsize) return acl::set_error(ACL_RC_BAD_ARGS, 88, "acl__read_acl_file", 4, 0);
+    if (!aclfbuf) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__read_acl_file", 3, 0);
+    if (!aclfsize) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, "acl__read_acl_file", 4, 0);
     tr::perf_timer timer(2);
     *aclfbuf = nullptr;
     *aclfsize = 0;

@@ -20,7 +20,8 @@ int ryacl_cmd_edit(int argc, char **argv);     // cmd_edit.cpp
 // Check the ACL file at `path` as `ryacl check --format=text` does, printing
 // its diagnostics to `out` under the name `display`.  Returns
 // RYACL_EXIT_OK (clean), RYACL_EXIT_FOUND (faults printed) or
-// RYACL_EXIT_TROUBLE (not read; the message, naming `display`, printed).
+// RYACL_EXIT_TROUBLE (not read; the message, after "`display`: ", printed
+// on standard error).
 int ryacl_check_text(const char *path, const char *display, FILE *out);
 
 // Compile the ACL file at `path` and store `path`.cacl exactly as

@@ -1,0 +1,99 @@
+// Ordering identifiers: the radix pass and the multikey quicksort against a
+// plain stable sort under the folded compare, ties beyond the sixteen
+// bytes the radix pass sees included.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <numeric>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "ry_zo_int.h"
+#include "ryacl_acl_sort.h"
+
+namespace {
+
+struct ref {
+    uint32_t off, len;
+};
+
+// The order the sort makes, for identifiers given in entry order.
+std::vector<uint32_t> sorted_by_sort(const std::vector<std::string> &ids) {
+    std::string arena;
+    std::vector<ref> refs;
+    for (const std::string &s : ids) {
+        refs.push_back({static_cast<uint32_t>(arena.size()), static_cast<uint32_t>(s.size())});
+        arena += s;
+        arena += '\0';
+    }
+    auto *keys = static_cast<acl__sort_key *>(std::malloc(acl__sort_area_bytes(ids.size())));
+    for (size_t j = 0; j < ids.size(); ++j) keys[j].i = static_cast<uint32_t>(j);
+    acl__sort_ids(keys, ids.size(), {arena.data(), refs.data(), sizeof(ref)});
+    std::vector<uint32_t> out;
+    for (size_t j = 0; j < ids.size(); ++j) out.push_back(keys[j].i);
+    std::free(keys);
+    return out;
+}
+
+// The same by the byte-wise folded compare, equal texts in entry order.
+std::vector<uint32_t> sorted_plainly(const std::vector<std::string> &ids) {
+    std::vector<uint32_t> out(ids.size());
+    std::iota(out.begin(), out.end(), 0u);
+    std::stable_sort(out.begin(), out.end(), [&](uint32_t a, uint32_t b) {
+        return zo_strcasecmp_posix_1(ids[a].c_str(), ids[b].c_str()) < 0;
+    });
+    return out;
+}
+
+// n identifiers over a small alphabet (letters of both cases, punctuation
+// that sorts between the cases, a byte above 0x7f), sharing a prefix of
+// `shared` bytes, so that many tie through the radix pass's sixteen bytes
+// and past it, some equal but for case, some prefixes of others.
+std::vector<std::string> identifiers(size_t n, size_t shared, unsigned seed) {
+    static const char alphabet[] = "aAbB_[\xc3";
+    std::mt19937 rng(seed);
+    const std::string prefix(shared, 'u');
+    std::vector<std::string> ids;
+    for (size_t i = 0; i < n; ++i) {
+        std::string s = prefix;
+        const size_t extra = rng() % 5;
+        for (size_t k = 0; k < extra; ++k) s += alphabet[rng() % (sizeof alphabet - 1)];
+        ids.push_back(s);
+    }
+    return ids;
+}
+
+TEST(AclSort, AgreesWithTheFoldedCompareAndKeepsEntryOrderOnTies) {
+    // Below the radix pass's smallest range, above it, and large enough
+    // for ranges to be split at several depths; prefixes that end before,
+    // at and beyond the sixteen bytes of the keys.
+    for (size_t n : {2u, 17u, 63u, 300u, 5000u})
+        for (size_t shared : {0u, 7u, 15u, 16u, 17u, 30u}) {
+            const std::vector<std::string> ids = identifiers(n, shared, static_cast<unsigned>(n + shared));
+            EXPECT_EQ(sorted_by_sort(ids), sorted_plainly(ids)) << n << " identifiers, prefix " << shared;
+        }
+}
+
+TEST(AclSort, ManyEqualTextsAndOrderedInputs) {
+    // Equal under folding, differing only in case far beyond sixteen bytes:
+    // entry order throughout.
+    std::vector<std::string> same;
+    for (int i = 0; i < 2000; ++i)
+        same.push_back(std::string(40, 'x') + (i % 2 ? "CASE" : "case") + std::string(i % 3, 'z'));
+    EXPECT_EQ(sorted_by_sort(same), sorted_plainly(same));
+
+    // Already ascending and descending, the inputs that defeat a naive pivot.
+    std::vector<std::string> up;
+    for (int i = 0; i < 3000; ++i) {
+        char b[32];
+        std::snprintf(b, sizeof b, "user%020d", i);
+        up.push_back(b);
+    }
+    EXPECT_EQ(sorted_by_sort(up), sorted_plainly(up));
+    std::reverse(up.begin(), up.end());
+    EXPECT_EQ(sorted_by_sort(up), sorted_plainly(up));
+}
+
+}  // namespace
