@@ -86,15 +86,6 @@ TEST(AclTree, OrderOfAnyInputThroughMemoryFailures) {
         }
 }
 
-// Identifiers that tie on their first sixteen folded bytes (both keys) are ordered by the rest, case folded.
-TEST(AclTree, OrderPastTheSixteenBytesOfTheKeys) {
-    const std::string p(20, 'p');
-    sec_acltree_t t = nullptr;
-    for (const char *s : {"c", "B", "d", "a", "E"}) ASSERT_EQ(add(&t, G, p + s), 0);
-    EXPECT_EQ(serialised(t), subacl(G, "", {{1, p + "a"}, {1, p + "B"}, {1, p + "c"}, {1, p + "d"}, {1, p + "E"}}));
-    sec__free_acltree(t);
-}
-
 // Singly a duplicate is refused; in a group insert its permission replaces
 // the stored one, which keeps its spelling.  In the one-entry form and after.
 TEST(AclTree, DuplicatesReplacementAndDeletion) {
