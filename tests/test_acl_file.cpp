@@ -110,6 +110,11 @@ TEST(AclCache, ExactBytesWithTheAclFilesIdentityOverAMatchingCacheOnly) {
     ASSERT_EQ(stat(acl.c_str(), &a) | stat(cache.c_str(), &c), 0);
     EXPECT_TRUE(c.st_uid == a.st_uid && c.st_gid == a.st_gid && c.st_mode == a.st_mode);
     EXPECT_EQ(rytest::list_dir(d.path()).size(), 2u);
+    // Set-id and sticky bits are the file's too (given after the owner, whose change may clear them).
+    ASSERT_EQ(chmod(acl.c_str(), 07640) | unlink(cache.c_str()), 0);
+    EXPECT_EQ(store(), "0/0");
+    ASSERT_EQ(stat(acl.c_str(), &a) | stat(cache.c_str(), &c), 0);
+    EXPECT_EQ(c.st_mode, a.st_mode);
     std::string name = d.path();  // 4089 characters fit, with the cache name in the area
     while (name.size() + 201 < 4038) ASSERT_EQ(mkdir((name += "/" + std::string(200, 'd')).c_str(), 0700), 0);
     rytest::write_file(name += "/" + std::string(4088 - name.size(), 'a'), "x");
