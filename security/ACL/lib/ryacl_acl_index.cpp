@@ -54,7 +54,7 @@ uint64_t process_seed() {
     static const uint64_t seed = [] {
         uint64_t s = kMixC;
         if (const void *r = reinterpret_cast<const void *>(getauxval(AT_RANDOM))) {
-            uint64_t w[2];
+            uint64_t w[2] = {};
             std::memcpy(w, r, sizeof w);
             s ^= mum(w[0] ^ kMixA, w[1] ^ kMixB);
         }
@@ -229,7 +229,7 @@ size_t map_subs(sec_acl_index_s *ix) {
             owner = &ix->by_type[plain_slot(type)];
             if (*owner) owner = nullptr;
         } else {
-            uint64_t w[2];
+            uint64_t w[2] = {};
             mech_key(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen - 1, w);
             uint32_t i = static_cast<uint32_t>(mech_hash(w, type, ix->seed)) & ix->mech_mask;
             while (ix->mechs[i].sub && !(ix->mechs[i].type == type && ix->mechs[i].w[0] == w[0] &&
