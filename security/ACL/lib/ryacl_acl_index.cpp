@@ -346,10 +346,14 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     if ((ix->bytes = static_cast<unsigned char *>(index_alloc(len + kPad, 1, &rc, false))) &&
         (ix->subs = static_cast<sub_info *>(index_alloc(nsub ? nsub : 1, sizeof(sub_info), &rc))) &&
         (ix->mechs = static_cast<mech_slot *>(index_alloc(nmech, sizeof(mech_slot), &rc)))) {
+        // Fresh pages are a third of the creation of a large index: fewer,
+        // larger ones where the blocks allow.
+        acl__advise_large(ix->bytes, len + kPad);
         std::memcpy(ix->bytes, p, len);
         std::memset(ix->bytes + len, 0, kPad);
         const size_t nslots = map_subs(ix);
         if ((ix->slots = static_cast<id_slot *>(index_alloc(nslots ? nslots : 1, sizeof(id_slot), &rc)))) {
+            acl__advise_large(ix->slots, nslots * sizeof(id_slot));
             for (uint32_t s = 0; s < ix->nsubs; ++s)
                 if (ix->subs[s].nslots) fill_table(ix, ix->subs[s]);
         }
