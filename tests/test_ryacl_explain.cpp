@@ -53,7 +53,7 @@ TEST_F(RyaclExplain, NamesTheDecidingEntriesAndWhatAMissSearched) {
         {{"--anyother"}, 1, "grant: none\nno entry matched: the ACL has no anyother entry\n"},
         {{"--identity=krb5:bob"}, 1, "grant: none\nno entry matched: the ACL has no user entries of mechanism krb5\n"},
         {{"--identity=unix:carol"}, 1,
-         "grant: none\nno entry matched: the user entries of mechanism unix (2, 2 searched) hold no identity carol\n"},
+         "grant: none\nno entry matched: the user entries of mechanism unix (2 entries, 2 searched) hold no identity carol\n"},
         {{"--groups=x"}, 1, "grant: none\nno entry matched: the group entries (2) name none of the groups\ngroup x: no entry\n"},
     };
     for (const probe &p : probes) {

@@ -146,14 +146,14 @@ unsigned char type_code(const line_parser::token &t) {
     }
 }
 
-fault missing() { return {ACL_RC_BAD_ACL, 158, nullptr}; }
-fault extra() { return {ACL_RC_BAD_ACL, 159, nullptr}; }
+fault missing() { return {ACL_RC_BAD_ACL, acl::msg::LINE_TOO_FEW_TOKENS.num, nullptr}; }
+fault extra() { return {ACL_RC_BAD_ACL, acl::msg::LINE_TOO_MANY_TOKENS.num, nullptr}; }
 
 // The permission token, then nothing but a comment.
 fault permissions(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t acle) {
     line_parser::token t = lp.read_token();
     if (sec__translate_perms(t.s, permset, &acle->perm) != ACL_RC_OK)
-        return {ACL_RC_PERMISSION, 166, t.s};
+        return {ACL_RC_PERMISSION, acl::msg::LINE_BAD_PERMS.num, t.s};
     if (t.ends_line || lp.at_end_mark()) return {};
     return extra();
 }
@@ -164,7 +164,7 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
 
     line_parser::token t = lp.read_token();
     const unsigned char type = type_code(t);
-    if (!type) return {ACL_RC_BAD_ACL, 165, t.s};
+    if (!type) return {ACL_RC_BAD_ACL, acl::msg::LINE_BAD_TYPE.num, t.s};
     acle->type = type;
     const bool no_names = !acl__type_has_id(type);  // unauthenticated, anyother
 
@@ -175,7 +175,7 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
     if (type == SEC_ACLE_TYPE_GROUP) {
         acle->id = t.s;
     } else {
-        if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, 132, t.s};
+        if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, acl::msg::LINE_MECH_TOO_LONG.num, t.s};
         for (size_t i = 0; i < t.len; ++i) {
             t.s[i] = static_cast<char>(zo_tolower_posix_1(static_cast<unsigned char>(t.s[i])));
             acle->mech[i] = t.s[i];
@@ -207,7 +207,7 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
     if (start[remaining - 1] != '\0') {
         // A text whose length does not end at a NUL would have every scan
         // run off its end; it is refused as corrupted, and consumed whole.
-        f = {ACL_RC_BAD_ACL, 131, nullptr};
+        f = {ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED.num, nullptr};
         *tacl = nullptr;
         *length = 0;
     } else {
@@ -219,10 +219,10 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
         lp.find_end();
 
         consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
-        if (consumed > LINE_MAX_BYTES) f = {ACL_RC_FILE_ERROR, 145, nullptr};
+        if (consumed > LINE_MAX_BYTES) f = {ACL_RC_FILE_ERROR, acl::msg::LINE_TOO_LONG.num, nullptr};
         if (lp.last) {
             // Nothing after a NUL is parsed, so the text is used up either way.
-            if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, 131, nullptr};
+            if (f.rc == ACL_RC_OK && consumed != remaining) f = {ACL_RC_BAD_ACL, acl::msg::LINE_CORRUPTED.num, nullptr};
             *tacl = nullptr;
             *length = 0;
         } else {
@@ -237,17 +237,23 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
 }
 
 int32_t acl__record_line_fault(const acl__line_fault &f) {
-    if (f.msg == 145) {
+    if (f.msg == acl::msg::LINE_TOO_LONG.num) {
         const int32_t len32 = f.length > INT32_MAX ? INT32_MAX : static_cast<int32_t>(f.length);
         acl::trace::point(acl::trace::ERRORS, 115, {acl::trace::val(f.line), acl::trace::val(len32)});
     }
     // A permission token that did not translate left message 133 behind;
     // the line's own message replaces it.
     acl::clear_error();
+    // Each message by name, so its arguments are checked where it is recorded.
+    using namespace acl::msg;
     switch (f.msg) {
-    case 132: return acl::set_error(f.rc, f.msg, f.token, f.line);
-    case 165: case 166: return acl::set_error(f.rc, f.msg, f.line, f.token);
-    default: return acl::set_error(f.rc, f.msg, f.line);
+    case LINE_MECH_TOO_LONG.num: return acl::set_error(f.rc, LINE_MECH_TOO_LONG, f.token, f.line);
+    case LINE_BAD_TYPE.num: return acl::set_error(f.rc, LINE_BAD_TYPE, f.line, f.token);
+    case LINE_BAD_PERMS.num: return acl::set_error(f.rc, LINE_BAD_PERMS, f.line, f.token);
+    case LINE_TOO_FEW_TOKENS.num: return acl::set_error(f.rc, LINE_TOO_FEW_TOKENS, f.line);
+    case LINE_TOO_MANY_TOKENS.num: return acl::set_error(f.rc, LINE_TOO_MANY_TOKENS, f.line);
+    case LINE_TOO_LONG.num: return acl::set_error(f.rc, LINE_TOO_LONG, f.line);
+    default: return acl::set_error(f.rc, LINE_CORRUPTED, f.line);
     }
 }
 

@@ -70,7 +70,7 @@ struct reader {
     struct stat cache_st {};
     char *aclfbuf = nullptr;
     size_t aclfsize = 0;
-    acl__textfile_opts opts{ACL_RC_FILE_ERROR, 122, 128, 124, true, false,
+    acl__textfile_opts opts{ACL_RC_FILE_ERROR, acl::msg::BAD_FILE.num, acl::msg::FILE_NOT_OWNED.num, acl::msg::FILE_OPEN.num, true, false,
                             tr::level(tr::INFO) > 7, permtmpl};
 
     reader(const char *fn, const char *un, const sec_perm_set_desc *pt, sec_buffer_t a, uint32_t f)

@@ -104,7 +104,8 @@ void check_stdin(file_report &r) {
         text.append(buf, static_cast<size_t>(n));
     }
     if (text.empty()) return;
-    acl__textfile_opts o{ACL_RC_BAD_FILE_NAME, 154, 155, 156};
+    acl__textfile_opts o{ACL_RC_BAD_FILE_NAME, acl::msg::CHECK_FILE_BAD.num, acl::msg::CHECK_FILE_NOT_OWNED.num,
+                         acl::msg::CHECK_FILE_OPEN.num};
     o.keep_going = true;
     o.permset = &acl__default_perm_set;
     collect_sink sink(r);

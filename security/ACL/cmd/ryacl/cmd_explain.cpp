@@ -144,7 +144,7 @@ int explain(const loaded_acl &acl, const request &rq) {
         }
         if (!hit) {
             out = std::string("grant: none\nno entry matched: the ") + ryacl::type_word(type) + " entries of mechanism " +
-                  show(s->mech) + " (" + std::to_string(s->items.size()) + ", " + std::to_string(searched) +
+                  show(s->mech) + " (" + std::to_string(s->items.size()) + " entries, " + std::to_string(searched) +
                   " searched) hold no identity " + show(rq.id) + "\n";
             status = RYACL_EXIT_FOUND;
             break;

@@ -14,9 +14,10 @@
 
 namespace {
 
-// The checker's own messages for the file: 154, 155, 156.
+// The checker's own messages for the file.
 acl__textfile_opts checker_opts(uint32_t flags) {
-    acl__textfile_opts o{ACL_RC_BAD_FILE_NAME, 154, 155, 156};
+    acl__textfile_opts o{ACL_RC_BAD_FILE_NAME, acl::msg::CHECK_FILE_BAD.num, acl::msg::CHECK_FILE_NOT_OWNED.num,
+                         acl::msg::CHECK_FILE_OPEN.num};
     o.keep_going = (flags & ACLFCK_CONTINUE) != 0;
     o.each_entry = (flags & ACLFCK_VERBOSE) != 0;
     o.permset = &acl__default_perm_set;
