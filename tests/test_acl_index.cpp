@@ -145,4 +145,28 @@ TEST(IndexEvaluation, AnswersAsTheWalkOnTheBytesItWasMadeFrom) {
     sec_release_acl_index(nullptr);
 }
 
+// Tables far larger than the cache, with entries out of order and
+// identifiers repeated in another case, answer as the walk does.
+TEST(IndexEvaluation, LargeTablesAnswerAsTheWalk) {
+    constexpr int kCount = 70000;
+    std::vector<ent> es;
+    char id[16];
+    for (int i = 0; i < kCount; ++i) {
+        const int k = i % 97 == 0 ? i - 500 : i % 101 == 0 ? i - 3 : i;
+        std::snprintf(id, sizeof id, i % 101 == 0 ? "U%06d" : "u%06d", k < 0 ? -k : k);
+        es.push_back({1u << (i % 13), id});
+    }
+    const bytes b = make_acl({subacl(4, "unix", es), subacl(16, "", es)});
+    sec_acl_index_t ix = index_of(b);
+    sec_buffer_desc d = own(b);
+    for (int i = 0; i < kCount + 200; i += 173) {
+        std::snprintf(id, sizeof id, i % 2 ? "U%06d" : "u%06d", i);
+        EXPECT_EQ(answer({4, "unix", nullptr, id}, nullptr, ix), answer({4, "unix", nullptr, id}, &d, nullptr)) << id;
+        EXPECT_EQ(answer({0, nullptr, nullptr, nullptr, {id}}, nullptr, ix),
+                  answer({0, nullptr, nullptr, nullptr, {id}}, &d, nullptr)) << id;
+    }
+    drop(d);
+    sec_release_acl_index(ix);
+}
+
 }  // namespace

@@ -279,7 +279,16 @@ int32_t tree_add(sec_boolean_t noupdate, const sec_acle_desc *e, sec_acl_buffer_
     sec_acltree_t tree = nullptr;
     size_t used = 0;
     int32_t rc = read_subacl(acl, where, &tree, &used);
-    if (!rc) rc = sec__add_acle_to_tree(noupdate, e, &tree);
+    // A sub-ACL found without entries gives no tree to carry its mechanism:
+    // the entry comes in under the sub-ACL's spelling, as into one with
+    // entries, not under the caller's.  Reading it checked that spelling.
+    sec_acle_desc spelt = *e;
+    if (!rc && where.found && !tree && acl__type_has_mech(e->type)) {
+        std::memset(spelt.mech, 0, sizeof spelt.mech);
+        std::memcpy(spelt.mech, static_cast<const unsigned char *>(acl->value) + where.s.off + ACL_SUBACL_HDR_SIZE,
+                    where.s.mechlen);
+    }
+    if (!rc) rc = sec__add_acle_to_tree(noupdate, &spelt, &tree);
     unsigned char *fresh = nullptr;
     size_t freshlen = 0;
     if (!rc) {

@@ -54,7 +54,7 @@ uint64_t process_seed() {
     static const uint64_t seed = [] {
         uint64_t s = kMixC;
         if (const void *r = reinterpret_cast<const void *>(getauxval(AT_RANDOM))) {
-            uint64_t w[2];
+            uint64_t w[2] = {};
             std::memcpy(w, r, sizeof w);
             s ^= mum(w[0] ^ kMixA, w[1] ^ kMixB);
         }
@@ -229,7 +229,7 @@ size_t map_subs(sec_acl_index_s *ix) {
             owner = &ix->by_type[plain_slot(type)];
             if (*owner) owner = nullptr;
         } else {
-            uint64_t w[2];
+            uint64_t w[2] = {};
             mech_key(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen - 1, w);
             uint32_t i = static_cast<uint32_t>(mech_hash(w, type, ix->seed)) & ix->mech_mask;
             while (ix->mechs[i].sub && !(ix->mechs[i].type == type && ix->mechs[i].w[0] == w[0] &&
@@ -346,10 +346,14 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     if ((ix->bytes = static_cast<unsigned char *>(index_alloc(len + kPad, 1, &rc, false))) &&
         (ix->subs = static_cast<sub_info *>(index_alloc(nsub ? nsub : 1, sizeof(sub_info), &rc))) &&
         (ix->mechs = static_cast<mech_slot *>(index_alloc(nmech, sizeof(mech_slot), &rc)))) {
+        // Fresh pages are a third of the creation of a large index: fewer,
+        // larger ones where the blocks allow.
+        acl__advise_large(ix->bytes, len + kPad);
         std::memcpy(ix->bytes, p, len);
         std::memset(ix->bytes + len, 0, kPad);
         const size_t nslots = map_subs(ix);
         if ((ix->slots = static_cast<id_slot *>(index_alloc(nslots ? nslots : 1, sizeof(id_slot), &rc)))) {
+            acl__advise_large(ix->slots, nslots * sizeof(id_slot));
             for (uint32_t s = 0; s < ix->nsubs; ++s)
                 if (ix->subs[s].nslots) fill_table(ix, ix->subs[s]);
         }

@@ -4,6 +4,8 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <cstdlib>
+#include <cstring>
 
 void *acl__malloc(size_t n);
 void *acl__calloc(size_t count, size_t size);
@@ -42,13 +44,21 @@ bool acl__grow(T **p, uint32_t *cap, size_t need, size_t *failed) {
         *failed = SIZE_MAX;
         return false;
     }
-    void *q = acl__realloc(*p, nc * sizeof(T));
+    // A large array is moved by hand into a block advised before the copy:
+    // realloc would fill the new block's pages 4 KiB at a time first.
+    const bool large = nc * sizeof(T) >= (size_t{4} << 20);
+    void *q = large ? acl__malloc(nc * sizeof(T)) : acl__realloc(*p, nc * sizeof(T));
     if (!q) {
         *failed = nc * sizeof(T);
         return false;
     }
+    if (large) {
+        acl__advise_large(q, nc * sizeof(T));
+        if (*p) std::memcpy(q, *p, size_t{*cap} * sizeof(T));
+        std::free(*p);
+    }
     *p = static_cast<T *>(q);
     *cap = static_cast<uint32_t>(nc);
-    acl__advise_large(q, nc * sizeof(T));
+    if (!large) acl__advise_large(q, nc * sizeof(T));
     return true;
 }

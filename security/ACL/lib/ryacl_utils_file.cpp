@@ -55,6 +55,8 @@ int32_t read_whole(const char *aclfname, int aclfdes, char **aclfbuf, size_t *ac
         tr::point(tr::INFO, 125, {tr::str(name), tr::val(size)});
         return acl__no_memory("sec_read_acl_file", want + 1);
     }
+    // A large file fills thousands of fresh pages; huge ones fault far less.
+    acl__advise_large(buf, want + 1);
 
     // read() may return less than asked on any file system; go on until the
     // size is reached or the file ends.  A file that grew is read only up

@@ -130,6 +130,13 @@ int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
     int32_t rc = acl__read_acl_file(path, fd, &out.bytes, &out.nbytes);
     close(fd);
     if (rc || !out.bytes) return rc;  // an empty file: no entries
+    return add_file_bytes(text_only, out);
+}
+
+}  // namespace
+
+int32_t add_file_bytes(bool text_only, loaded_acl &out) {
+    int32_t rc;
     const auto *p = reinterpret_cast<const unsigned char *>(out.bytes);
     if (text_only || out.nbytes < 2 || p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION)
         return out.add_text(out.bytes, out.nbytes);
@@ -143,8 +150,6 @@ int32_t read_acl_file(const char *path, bool text_only, loaded_acl &out) {
     if ((rc = sec__check_acl_buffer(&d)) != 0) return rc;
     return out.add_compiled(p, out.nbytes);
 }
-
-}  // namespace
 
 bool load_acl_file(const char *path, bool text_only, loaded_acl &out, bool screen) {
     int32_t rc = read_acl_file(path, text_only, out);

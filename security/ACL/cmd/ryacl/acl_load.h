@@ -64,6 +64,10 @@ private:
 // On failure the numbered message is on standard error and the result is
 // false.
 bool load_acl_file(const char *path, bool text_only, loaded_acl &out, bool screen = true);
+// The entries of the file's bytes in out.bytes (out.nbytes of them and a
+// zero byte after), read as load_acl_file reads them but not screened: 0,
+// or the return code of the first fault, recorded.
+int32_t add_file_bytes(bool text_only, loaded_acl &out);
 // Load a compiled ACL in host byte order that the library has validated.
 bool load_acl_buffer(const sec_buffer_desc &buf, const std::string &path, loaded_acl &out);
 
