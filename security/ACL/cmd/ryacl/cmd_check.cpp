@@ -260,7 +260,13 @@ int ryacl_cmd_check(int argc, char **argv) {
             else if (!std::strcmp(optarg, "gcc")) fmt = format::gcc;
             else if (!std::strcmp(optarg, "json")) fmt = format::json;
             else if (!std::strcmp(optarg, "sarif")) fmt = format::sarif;
-            else return ryacl_util::usage_error(("'" + zo::escape_controls(optarg) + "' is not a format").c_str(), kUsage);
+            else {
+                // Appended, not `"'" + text`: g++ 12 warns falsely (-Wrestrict) on that form.
+                std::string why = zo::escape_controls(optarg);
+                why.insert(0, 1, '\'');
+                why += "' is not a format";
+                return ryacl_util::usage_error(why.c_str(), kUsage);
+            }
             break;
         case 'u':
             if (user) return ryacl_util::usage_error("--user given more than once", kUsage);
