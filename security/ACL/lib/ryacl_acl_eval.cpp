@@ -105,15 +105,9 @@ int32_t single_perm(sec_acl_buffer_t acl, unsigned char type, const char *mech, 
         return 0;
     }
 
-    sec_acl_id_handler handler = nullptr;
-    if (acletype == SEC_ACLE_TYPE_EXPANDED) {
-        sec__get_id_handler(SEC_ID_HANDLER_EXPANDED, mech, &handler);
-        // Expanded identities are only ever matched by their mechanism's
-        // handler.
-        if (!handler) return no_entry(type, mech, id);
-    } else if (type & SEC_ACLE_USE_ID_HANDLER) {
-        sec__get_id_handler(SEC_ID_HANDLER_USER, mech, &handler);
-    }
+    const sec_acl_id_handler handler = acl__eval_handler(acletype, type, mech);
+    // Expanded identities are only ever matched by their mechanism's handler.
+    if (acletype == SEC_ACLE_TYPE_EXPANDED && !handler) return no_entry(type, mech, id);
 
     uint32_t granted = 0;
     const int32_t m = handler ? match_entry(walk, acletype == SEC_ACLE_TYPE_USER,

@@ -409,13 +409,9 @@ int32_t single(const sec_acl_index_s *ix, unsigned char type, const char *mech, 
         return 0;
     }
 
-    sec_acl_id_handler handler = nullptr;
-    if (acletype == SEC_ACLE_TYPE_EXPANDED) {
-        sec__get_id_handler(SEC_ID_HANDLER_EXPANDED, mech, &handler);
-        if (!handler) return no_entry(type, mech, id);
-    } else if (type & SEC_ACLE_USE_ID_HANDLER) {
-        sec__get_id_handler(SEC_ID_HANDLER_USER, mech, &handler);
-    }
+    const sec_acl_id_handler handler = acl__eval_handler(acletype, type, mech);
+    // Expanded identities are only ever matched by their mechanism's handler.
+    if (acletype == SEC_ACLE_TYPE_EXPANDED && !handler) return no_entry(type, mech, id);
     if (!handler) {
         const unsigned char *hit = probe(ix, *s, id, std::strlen(id));
         if (!hit) return no_entry(type, mech, id);

@@ -42,3 +42,16 @@ void acl__state_ensure_init();
 // First handler registered for type and mech (case-insensitive), or null.
 // Takes no lock; always 0.
 int32_t sec__get_id_handler(uint32_t type, const char *mech, sec_acl_id_handler *handler);
+
+// The handler an evaluation of an entry of `acletype` consults: the
+// mechanism's expanded handler (without one no expanded identity matches),
+// or its user handler when the caller's `type` asks for one.  Shared by the
+// walk and the index so both consult the registry alike.
+inline sec_acl_id_handler acl__eval_handler(unsigned char acletype, unsigned char type, const char *mech) {
+    sec_acl_id_handler handler = nullptr;
+    if (acletype == SEC_ACLE_TYPE_EXPANDED)
+        sec__get_id_handler(SEC_ID_HANDLER_EXPANDED, mech, &handler);
+    else if (type & SEC_ACLE_USE_ID_HANDLER)
+        sec__get_id_handler(SEC_ID_HANDLER_USER, mech, &handler);
+    return handler;
+}

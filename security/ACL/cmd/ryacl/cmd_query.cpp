@@ -39,6 +39,17 @@ const char kListUsage[] =
     "Usage: ryacl list [OPTION]... FILE\n"
     "Try 'ryacl list --help' for more information.\n";
 
+// The options for reading FILE, alike in query's and list's help.
+#define READING_OPTIONS \
+    "  -u, --user=NAME          FILE is a simple name in the home directory of\n" \
+    "                           NAME, who must own it; only NAME may write it\n" \
+    "  -t, --from-text          ignore the cache file FILE.cacl, compile the text\n" \
+    "  -w, --write-cache        store FILE.cacl after compiling the text\n" \
+    "  -C, --verify-cache       validate FILE.cacl before using it; when it is\n" \
+    "                           refused, compile the text instead\n" \
+    "  -v, --verbose            tell on standard error where the ACL came from\n" \
+    "  -h, --help               show this help and exit\n"
+
 const char kHelp[] =
     "Usage: ryacl query [OPTION]... QUERY FILE\n"
     "Show what the ACL file FILE grants to a client.\n"
@@ -53,14 +64,7 @@ const char kHelp[] =
     "                           ACL file format (as 'ryacl list')\n"
     "\n"
     "Reading FILE:\n"
-    "  -u, --user=NAME          FILE is a simple name in the home directory of\n"
-    "                           NAME, who must own it; only NAME may write it\n"
-    "  -t, --from-text          ignore the cache file FILE.cacl, compile the text\n"
-    "  -w, --write-cache        store FILE.cacl after compiling the text\n"
-    "  -C, --verify-cache       validate FILE.cacl before using it; when it is\n"
-    "                           refused, compile the text instead\n"
-    "  -v, --verbose            tell on standard error where the ACL came from\n"
-    "  -h, --help               show this help and exit\n"
+    READING_OPTIONS
     "  -V, --version            show the version and exit\n"
     "\n"
     "A grant is printed as permission letters and as a mask, for example\n"
@@ -79,14 +83,7 @@ const char kListHelp[] =
     "List every entry of the ACL file FILE, one line each, in the ACL file\n"
     "format, the mask as a comment.\n"
     "\n"
-    "  -u, --user=NAME          FILE is a simple name in the home directory of\n"
-    "                           NAME, who must own it; only NAME may write it\n"
-    "  -t, --from-text          ignore the cache file FILE.cacl, compile the text\n"
-    "  -w, --write-cache        store FILE.cacl after compiling the text\n"
-    "  -C, --verify-cache       validate FILE.cacl before using it; when it is\n"
-    "                           refused, compile the text instead\n"
-    "  -v, --verbose            tell on standard error where the ACL came from\n"
-    "  -h, --help               show this help and exit\n"
+    READING_OPTIONS
     "\n"
     "Exit status: 0 when listed, 2 for wrong usage or when the library failed\n"
     "(its message on standard error).\n";
