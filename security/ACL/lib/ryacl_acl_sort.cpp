@@ -1,6 +1,6 @@
-// Ordering identifiers (see ryacl_acl_sort.h): a most-significant-byte
-// radix pass over the first sixteen folded bytes, then a multikey
-// quicksort of what is still tied.
+// Ordering identifiers (see ryacl_acl_sort.h): most-significant-byte radix
+// passes over the first twelve folded bytes, then a multikey quicksort of
+// what is still tied.
 #include "ryacl_acl_sort.h"
 
 #include <bit>
@@ -14,39 +14,57 @@ namespace {
 using zo::fold;
 using zo::fold8;
 using skey = acl__sort_key;
+static_assert(sizeof(skey) == 16, "a key is two to a cache line's quarter");
 
-// Multikey quicksort on eight folded bytes at a time: the keys of a range
-// are compared as integers, and only a range whose keys tie moves on to the
-// next eight bytes.  Identifiers of a real ACL share long prefixes
-// ("user0001..."), which would make a plain comparison sort chase every
-// string through memory.
+// Folded bytes a key holds: eight in k, four in k2.
+constexpr unsigned kKeyBytes = 12;
 
+// Folded bytes [depth, depth + 8) of a text of len bytes as a big-endian
+// integer, zero past its end: integer order is then text order.
 uint64_t chunk(const char *s, size_t len, size_t depth) {
     if (depth >= len) return 0;
-    unsigned char b[8] = {};
-    size_t m = len - depth < 8 ? len - depth : 8;
-    std::memcpy(b, s + depth, m);
-    uint64_t v;
-    std::memcpy(&v, b, 8);
+    uint64_t v = 0;
+    if (len - depth >= 8) v = zo::load8(s + depth);
+    else std::memcpy(&v, s + depth, len - depth);
     v = fold8(v);
-    std::memcpy(b, &v, 8);
-    uint64_t k = 0;
-    for (unsigned j = 0; j < 8; ++j) k = (k << 8) | b[j];
-    return k;
+    if constexpr (std::endian::native == std::endian::little) v = __builtin_bswap64(v);
+    return v;
 }
 
-// A range of the key array whose entries share their first d bytes.
+bool key_less(const skey &x, const skey &y) { return x.k != y.k ? x.k < y.k : x.k2 < y.k2; }
+bool key_equal(const skey &x, const skey &y) { return x.k == y.k && x.k2 == y.k2; }
+// The text ended inside the key (no identifier holds a NUL): keys that are
+// equal and end are equal texts.
+bool key_ends(const skey &x) { return (x.k2 & 0xff) == 0; }
+
+// Byte d (0 to 11) of the key.
+unsigned byte_at(const skey &x, unsigned d) {
+    return d < 8 ? static_cast<unsigned>(x.k >> (56 - 8 * d)) & 0xff
+                 : static_cast<unsigned>(x.k2 >> (24 - 8 * (d - 8))) & 0xff;
+}
+
+// A range of keys, in the first or the second half of the work area, whose
+// entries share their first d folded bytes.
 struct rtask {
     size_t lo, n;
     unsigned d;
+    bool in_b;
 };
 // Ranges this small sort faster by comparison than by another pass.
-constexpr size_t kRadixMin = 64;
-// Sixteen levels of at most 255 ranges waiting each, and the one at work.
-constexpr size_t kRadixStack = 16 * 255 + 1;
+constexpr size_t kRadixMin = 32;
+// Ranges waiting: at most 255 at each of twelve levels, and, since each
+// holds more than kRadixMin keys of its own, at most n / (kRadixMin + 1).
+// Sized by n, the area of a small tree stays small: a million-entry file
+// of 65,534 sub-ACLs sorts each one in a block the allocator recycles
+// without consolidating its free lists every time.
+size_t radix_stack(size_t n) {
+    const size_t by_levels = kKeyBytes * 255 + 1, by_keys = n / (kRadixMin + 1) + 1;
+    return by_keys < by_levels ? by_keys : by_levels;
+}
 
 struct sorter {
-    skey *a;
+    skey *a;  // the keys, and where they end up
+    skey *b;  // as many again: a pass moves a range from one to the other
     const acl__id_table &ids;
 
     uint32_t ref(uint32_t i, size_t field) const {
@@ -57,62 +75,50 @@ struct sorter {
     const char *text(uint32_t i) const { return ids.arena + ref(i, 0); }
     size_t length(uint32_t i) const { return ref(i, 1); }
 
-    // Sixteen bytes per load: most identifiers part within them, so a tied
-    // range usually moves on to its next eight bytes without going back to
-    // the arena (where, once partitioned, every access would be a miss).
+    // Keys of a[lo, lo + n) from `depth` on.
     void load(size_t lo, size_t n, size_t depth) {
         for (size_t j = lo; j < lo + n; ++j) {
             const char *s = text(a[j].i);
             const size_t len = length(a[j].i);
             a[j].k = chunk(s, len, depth);
-            a[j].next = chunk(s, len, depth + 8);
+            a[j].k2 = static_cast<uint32_t>(chunk(s, len, depth + 8) >> 32);
         }
-    }
-    // Move a tied range on to depth (8 further); true when `next` is again
-    // valid afterwards.
-    bool advance(size_t lo, size_t n, size_t depth, bool nv) {
-        if (!nv) {
-            load(lo, n, depth);
-            return true;
-        }
-        for (size_t j = lo; j < lo + n; ++j) a[j].k = a[j].next;
-        return false;
     }
     // Full order of two entries whose first `depth` folded bytes are equal
-    // and whose keys hold the next eight.
-    bool less(const skey &x, const skey &y, size_t depth, bool nv) const {
-        if (x.k != y.k) return x.k < y.k;
-        if (nv && x.next != y.next) return x.next < y.next;
-        size_t from = depth + 8;
+    // and whose keys hold the next twelve.
+    bool less(const skey &x, const skey &y, size_t depth) const {
+        if (!key_equal(x, y)) return key_less(x, y);
+        if (key_ends(x)) return x.i < y.i;  // equal texts: keep insertion order
         const char *p = text(x.i), *q = text(y.i);
-        size_t lp = length(x.i), lq = length(y.i);
-        for (size_t j = from;; ++j) {
+        const size_t lp = length(x.i), lq = length(y.i);
+        for (size_t j = depth + kKeyBytes;; ++j) {
             int cp = j < lp ? fold(static_cast<unsigned char>(p[j])) : -1;
             int cq = j < lq ? fold(static_cast<unsigned char>(q[j])) : -1;
             if (cp != cq) return cp < cq;
-            if (cp < 0) return x.i < y.i;  // equal texts: keep insertion order
+            if (cp < 0) return x.i < y.i;
         }
     }
-    void insertion(size_t lo, size_t n, size_t depth, bool nv) {
+    void insertion(skey *s, size_t lo, size_t n, size_t depth) const {
         for (size_t j = lo + 1; j < lo + n; ++j) {
-            skey v = a[j];
+            skey v = s[j];
             size_t m = j;
-            while (m > lo && less(v, a[m - 1], depth, nv)) {
-                a[m] = a[m - 1];
+            while (m > lo && less(v, s[m - 1], depth)) {
+                s[m] = s[m - 1];
                 --m;
             }
-            a[m] = v;
+            s[m] = v;
         }
     }
-    // Fallback when partitioning stops making progress: O(n log n) always.
-    void heapsort(size_t lo, size_t n, size_t depth, bool nv) {
+    // Fallback when partitioning stops making progress, and the order of
+    // equal texts that partitioning has shuffled: O(n log n) always.
+    void heapsort(size_t lo, size_t n, size_t depth) const {
         skey *h = a + lo;
         auto sift = [&](size_t root, size_t end) {
             for (;;) {
                 size_t c = 2 * root + 1;
                 if (c >= end) return;
-                if (c + 1 < end && less(h[c], h[c + 1], depth, nv)) ++c;
-                if (!less(h[root], h[c], depth, nv)) return;
+                if (c + 1 < end && less(h[c], h[c + 1], depth)) ++c;
+                if (!less(h[root], h[c], depth)) return;
                 std::swap(h[root], h[c]);
                 root = c;
             }
@@ -123,13 +129,20 @@ struct sorter {
             sift(0, end);
         }
     }
+    void small_sort(size_t lo, size_t n, size_t depth) const {
+        if (n <= 16) insertion(a, lo, n, depth);
+        else heapsort(lo, n, depth);
+    }
 
-    // Multikey quicksort of [lo, lo + n), whose keys hold bytes 0 to 15.
-    void quicksort(size_t lo, size_t n) {
+    // Multikey quicksort of a[lo, lo + n), whose keys hold bytes
+    // [depth, depth + 12): a range is partitioned on its keys as integers,
+    // and only a range whose keys tie moves on to the next twelve bytes.
+    // Identifiers of a real ACL share long prefixes ("user0001..."), which
+    // would make a plain comparison sort chase every string through memory.
+    void quicksort(size_t lo, size_t n, size_t depth) {
         struct task {
             size_t lo, n, depth;
             unsigned budget;
-            bool nv;  // `next` holds the eight bytes after the key
         };
         // Continuing with the smallest piece and pushing the others keeps the
         // stack within two entries per halving of the range: 2 * 32 + slack.
@@ -137,36 +150,37 @@ struct sorter {
         size_t sp = 0;
         unsigned budget0 = 2;
         for (size_t m = n; m > 1; m >>= 1) budget0 += 2;
-        task cur{lo, n, 0, budget0, true};
+        task cur{lo, n, depth, budget0};
         for (;;) {
             while (cur.n > 1) {
                 if (cur.n <= 16) {
-                    insertion(cur.lo, cur.n, cur.depth, cur.nv);
+                    insertion(a, cur.lo, cur.n, cur.depth);
                     break;
                 }
                 if (cur.budget == 0) {
-                    heapsort(cur.lo, cur.n, cur.depth, cur.nv);
+                    heapsort(cur.lo, cur.n, cur.depth);
                     break;
                 }
-                uint64_t x = a[cur.lo].k, y = a[cur.lo + cur.n / 2].k, z = a[cur.lo + cur.n - 1].k;
-                uint64_t p = x < y ? (y < z ? y : (x < z ? z : x)) : (x < z ? x : (y < z ? z : y));
+                const skey &x = a[cur.lo], &y = a[cur.lo + cur.n / 2], &z = a[cur.lo + cur.n - 1];
+                const skey p = key_less(x, y) ? (key_less(y, z) ? y : (key_less(x, z) ? z : x))
+                                              : (key_less(x, z) ? x : (key_less(y, z) ? z : y));
                 size_t lt = cur.lo, j = cur.lo, gt = cur.lo + cur.n;
                 while (j < gt) {
-                    if (a[j].k < p) std::swap(a[lt++], a[j++]);
-                    else if (a[j].k > p) std::swap(a[j], a[--gt]);
+                    if (key_less(a[j], p)) std::swap(a[lt++], a[j++]);
+                    else if (key_less(p, a[j])) std::swap(a[j], a[--gt]);
                     else ++j;
                 }
-                task pieces[3] = {{cur.lo, lt - cur.lo, cur.depth, cur.budget - 1, cur.nv},
-                                  {lt, gt - lt, cur.depth + 8, budget0, false},
-                                  {gt, cur.lo + cur.n - gt, cur.depth, cur.budget - 1, cur.nv}};
-                // Keys that end inside this chunk are equal texts: done.  Else
-                // the tied range goes on with its next eight bytes.
-                if ((p & 0xff) == 0 || pieces[1].n < 2) {
-                    if ((p & 0xff) == 0 && pieces[1].n > 1)
-                        insertion(pieces[1].lo, pieces[1].n, cur.depth, cur.nv);
+                task pieces[3] = {{cur.lo, lt - cur.lo, cur.depth, cur.budget - 1},
+                                  {lt, gt - lt, cur.depth + kKeyBytes, budget0},
+                                  {gt, cur.lo + cur.n - gt, cur.depth, cur.budget - 1}};
+                // Keys that end inside these twelve bytes are equal texts,
+                // put back in insertion order.  Else the tied range goes on
+                // with its next twelve bytes.
+                if (key_ends(p) || pieces[1].n < 2) {
+                    if (key_ends(p) && pieces[1].n > 1) small_sort(pieces[1].lo, pieces[1].n, cur.depth);
                     pieces[1].n = 0;
                 } else {
-                    pieces[1].nv = advance(pieces[1].lo, pieces[1].n, pieces[1].depth, cur.nv);
+                    load(pieces[1].lo, pieces[1].n, pieces[1].depth);
                 }
                 int small = -1;
                 for (int q = 0; q < 3; ++q)
@@ -181,75 +195,81 @@ struct sorter {
         }
     }
 
-    // Byte d (0 to 15) of the key that `k` and `next` hold from depth 0.
-    static unsigned byte_at(const skey &x, unsigned d) {
-        const uint64_t w = d < 8 ? x.k : x.next;
-        return static_cast<unsigned>(w >> (56 - 8 * (d & 7))) & 0xff;
-    }
-
-    // How many of the sixteen key bytes every entry of [lo, lo + n) shares
+    // How many of the twelve key bytes every key of s[lo, lo + n) shares
     // with the first, knowing that the first `from` are shared.
-    unsigned shared_bytes(size_t lo, size_t n, unsigned from) const {
-        uint64_t dk = 0, dn = 0;
+    static unsigned shared_bytes(const skey *s, size_t lo, size_t n, unsigned from) {
+        uint64_t dk = 0;
+        uint32_t dk2 = 0;
         for (size_t j = lo + 1; j < lo + n; ++j) {
-            dk |= a[j].k ^ a[lo].k;
-            dn |= a[j].next ^ a[lo].next;
+            dk |= s[j].k ^ s[lo].k;
+            dk2 |= s[j].k2 ^ s[lo].k2;
         }
         const unsigned same = dk ? static_cast<unsigned>(std::countl_zero(dk)) / 8
-                                 : 8 + (dn ? static_cast<unsigned>(std::countl_zero(dn)) / 8 : 8);
+                                 : 8 + (dk2 ? static_cast<unsigned>(std::countl_zero(dk2)) / 8 : 4);
         return same > from ? same : from;
     }
 
-    // Most significant byte first, in place (American flag sort): each pass
-    // moves a range's entries once into its buckets, where quicksort would
-    // move them once per halving.  Bytes every entry of a range shares are
-    // stepped over without moving anything.  Small ranges, and ranges tied
-    // through all sixteen bytes, go to quicksort, which begins at byte 0
-    // again: the keys are unchanged, so the order it makes is the same.
+    // A range whose order is final: where it must end up.
+    void settle(const rtask &t) const {
+        if (t.in_b) std::memcpy(a + t.lo, b + t.lo, t.n * sizeof(skey));
+    }
+
+    // Most significant byte first.  Each pass distributes a range from one
+    // half of the work area into the other in one sequential read: the
+    // moves of a pass are independent of each other, where moving keys in
+    // place would chain every move on the one before.  Distribution is
+    // stable, so keys that stay tied keep their (ascending) entry order.
+    // Bytes every key of a range shares are stepped over without a pass.
+    // Small ranges are sorted by comparison, ranges tied through all twelve
+    // bytes by the multikey quicksort from there on.
     void sort(size_t n, rtask *stack) {
         load(0, n, 0);
         size_t sp = 0;
-        stack[sp++] = {0, n, 0};
+        stack[sp++] = {0, n, 0, false};
         size_t count[256], next[256];
         while (sp) {
             rtask t = stack[--sp];
+            skey *src = t.in_b ? b : a, *dst = t.in_b ? a : b;
             for (;;) {
-                if (t.n <= kRadixMin || t.d >= 16) {
-                    quicksort(t.lo, t.n);
+                if (t.n <= kRadixMin) {  // only the whole array comes here small
+                    insertion(src, t.lo, t.n, 0);
+                    break;
+                }
+                if (t.d >= kKeyBytes) {
+                    settle(t);
+                    // Equal texts are in entry order already.
+                    if (!key_ends(a[t.lo])) {
+                        load(t.lo, t.n, kKeyBytes);
+                        quicksort(t.lo, t.n, kKeyBytes);
+                    }
                     break;
                 }
                 std::memset(count, 0, sizeof count);
-                for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(a[j], t.d)];
-                if (count[byte_at(a[t.lo], t.d)] == t.n) {
+                for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(src[j], t.d)];
+                if (count[byte_at(src[t.lo], t.d)] == t.n) {
                     // One shared byte: find in one pass how many the whole
                     // range shares ("user0..." shares five), rather than a
                     // counting pass for each.
-                    t.d = shared_bytes(t.lo, t.n, t.d + 1);
+                    t.d = shared_bytes(src, t.lo, t.n, t.d + 1);
                     continue;
                 }
-                size_t start[256];
-                for (size_t b = 0, at = t.lo; b < 256; ++b) {
-                    start[b] = next[b] = at;
-                    at += count[b];
+                for (size_t c = 0, at = t.lo; c < 256; ++c) {
+                    next[c] = at;
+                    at += count[c];
                 }
-                for (unsigned b = 0; b < 256; ++b) {
-                    const size_t end = start[b] + count[b];
-                    while (next[b] < end) {
-                        skey v = a[next[b]];
-                        unsigned c = byte_at(v, t.d);
-                        while (c != b) {
-                            std::swap(v, a[next[c]++]);
-                            c = byte_at(v, t.d);
-                        }
-                        a[next[b]++] = v;
+                for (size_t j = t.lo; j < t.lo + t.n; ++j) dst[next[byte_at(src[j], t.d)]++] = src[j];
+                for (unsigned c = 0; c < 256; ++c) {
+                    if (!count[c]) continue;
+                    const rtask sub{next[c] - count[c], count[c], t.d + 1, !t.in_b};
+                    // Bucket 0 holds identifiers that end here (none holds a
+                    // NUL): equal texts, in entry order.
+                    if (c != 0 && sub.n > kRadixMin) {
+                        stack[sp++] = sub;
+                        continue;
                     }
+                    if (c != 0) insertion(dst, sub.lo, sub.n, 0);
+                    settle(sub);
                 }
-                // Bucket 0 holds identifiers that end here (none holds a
-                // NUL): equal texts, which quicksort leaves in insertion
-                // order.
-                if (count[0] > 1) quicksort(start[0], count[0]);
-                for (unsigned b = 1; b < 256; ++b)
-                    if (count[b] > 1) stack[sp++] = {start[b], count[b], t.d + 1};
                 break;
             }
         }
@@ -258,11 +278,11 @@ struct sorter {
 
 }  // namespace
 
-size_t acl__sort_area_bytes(size_t n) { return n * sizeof(skey) + kRadixStack * sizeof(rtask); }
+size_t acl__sort_area_bytes(size_t n) { return 2 * n * sizeof(skey) + radix_stack(n) * sizeof(rtask); }
 
-size_t acl__sort_max_keys() { return (SIZE_MAX - kRadixStack * sizeof(rtask)) / sizeof(skey); }
+size_t acl__sort_max_keys() { return (SIZE_MAX - radix_stack(SIZE_MAX) * sizeof(rtask)) / (2 * sizeof(skey)); }
 
 void acl__sort_ids(acl__sort_key *keys, size_t n, const acl__id_table &ids) {
     if (n < 2) return;
-    sorter{keys, ids}.sort(n, reinterpret_cast<rtask *>(keys + n));
+    sorter{keys, keys + n, ids}.sort(n, reinterpret_cast<rtask *>(keys + 2 * n));
 }
