@@ -50,16 +50,32 @@ struct rtask {
     unsigned d;
     bool in_b;
 };
-// Ranges this small sort faster by comparison than by another pass.
+// Ranges this small sort faster by comparison than by another pass; up to
+// kRadixMin keys, only when the byte at hand takes fewer values than there
+// are keys (the digits of "user0000123" do).
+constexpr size_t kLeafMax = 8;
 constexpr size_t kRadixMin = 32;
-// Ranges waiting: at most 255 at each of twelve levels, and, since each
-// holds more than kRadixMin keys of its own, at most n / (kRadixMin + 1).
-// Sized by n, the area of a small tree stays small: a million-entry file
-// of 65,534 sub-ACLs sorts each one in a block the allocator recycles
-// without consolidating its free lists every time.
+// The first pass over a large array may distribute on two bytes at once:
+// a million identifiers sharing "user" then fall into a hundred ranges of
+// ten thousand that sort in cache, where one byte leaves ten of a hundred
+// thousand for another pass through memory.  Only while the two bytes take
+// few values: scattered over thousands of places, the moves of a pass
+// would each miss the cache.
+constexpr size_t kWideMin = size_t{1} << 16;
+constexpr size_t kWideDigits = size_t{1} << 16;
+constexpr size_t kWideMaxUsed = 1024;
+// Ranges waiting: those of the first pass, at most 255 at each further
+// level, and, since each holds more than kLeafMax keys of its own, at most
+// n / (kLeafMax + 1).  Sized by n, the area of a small tree stays small: a
+// million-entry file of 65,534 sub-ACLs sorts each one in a block the
+// allocator recycles without consolidating its free lists every time.
 size_t radix_stack(size_t n) {
-    const size_t by_levels = kKeyBytes * 255 + 1, by_keys = n / (kRadixMin + 1) + 1;
+    const size_t by_levels = kWideMaxUsed + kKeyBytes * 255 + 1, by_keys = n / (kLeafMax + 1) + 1;
     return by_keys < by_levels ? by_keys : by_levels;
+}
+// Counters of the two-byte pass, behind the stack.
+size_t wide_bytes(size_t n) {
+    return n >= kWideMin && n <= UINT32_MAX ? kWideDigits * sizeof(uint32_t) : 0;
 }
 
 struct sorter {
@@ -83,6 +99,25 @@ struct sorter {
             a[j].k = chunk(s, len, depth);
             a[j].k2 = static_cast<uint32_t>(chunk(s, len, depth + 8) >> 32);
         }
+    }
+    // Keys of the whole array from depth 0, and how many bytes of them all
+    // keys share, found on the way rather than by a pass of its own.
+    unsigned load_all(size_t n) {
+        load(0, 1, 0);
+        uint64_t dk = 0;
+        uint32_t dk2 = 0;
+        for (size_t j = 1; j < n; ++j) {
+            load(j, 1, 0);
+            dk |= a[j].k ^ a[0].k;
+            dk2 |= a[j].k2 ^ a[0].k2;
+        }
+        return differing_from(dk, dk2);
+    }
+    // The first key byte in which the keys ORed into dk and dk2 differ (12:
+    // none).
+    static unsigned differing_from(uint64_t dk, uint32_t dk2) {
+        return dk ? static_cast<unsigned>(std::countl_zero(dk)) / 8
+                  : 8 + (dk2 ? static_cast<unsigned>(std::countl_zero(dk2)) / 8 : 4);
     }
     // Full order of two entries whose first `depth` folded bytes are equal
     // and whose keys hold the next twelve.
@@ -204,14 +239,51 @@ struct sorter {
             dk |= s[j].k ^ s[lo].k;
             dk2 |= s[j].k2 ^ s[lo].k2;
         }
-        const unsigned same = dk ? static_cast<unsigned>(std::countl_zero(dk)) / 8
-                                 : 8 + (dk2 ? static_cast<unsigned>(std::countl_zero(dk2)) / 8 : 4);
+        const unsigned same = differing_from(dk, dk2);
         return same > from ? same : from;
     }
 
     // A range whose order is final: where it must end up.
     void settle(const rtask &t) const {
         if (t.in_b) std::memcpy(a + t.lo, b + t.lo, t.n * sizeof(skey));
+    }
+
+    // A distributed range: each bucket either waits on the stack or, when
+    // small or made of texts that ended, is finished at once.  `ended`
+    // says of a bucket that its texts end inside the bytes distributed on.
+    void take_bucket(const rtask &sub, bool ended, rtask *stack, size_t &sp) const {
+        if (!ended && sub.n > kLeafMax) {
+            stack[sp++] = sub;
+            return;
+        }
+        // Texts that ended are equal, in entry order already.
+        if (!ended) insertion(sub.in_b ? b : a, sub.lo, sub.n, 0);
+        settle(sub);
+    }
+
+    // The first pass on the two bytes from d of the whole array, when they
+    // take few enough values; false, and nothing moved, when they do not.
+    bool wide_pass(size_t n, unsigned d, uint32_t *count, rtask *stack, size_t &sp) {
+        std::memset(count, 0, kWideDigits * sizeof *count);
+        auto digit = [d](const skey &x) { return byte_at(x, d) << 8 | byte_at(x, d + 1); };
+        for (size_t j = 0; j < n; ++j) ++count[digit(a[j])];
+        size_t used = 0;
+        for (size_t g = 0; g < kWideDigits; ++g) used += count[g] != 0;
+        if (used > kWideMaxUsed) return false;
+        // Starts, then (after the moves) ends of the buckets.
+        uint32_t at = 0;
+        for (size_t g = 0; g < kWideDigits; ++g) {
+            const uint32_t m = count[g];
+            count[g] = at;
+            at += m;
+        }
+        for (size_t j = 0; j < n; ++j) b[count[digit(a[j])]++] = a[j];
+        for (size_t g = 0, lo = 0; g < kWideDigits; lo = count[g++]) {
+            if (count[g] == lo) continue;
+            // A zero byte: the texts ended at byte d or d + 1.
+            take_bucket({lo, count[g] - lo, d + 2, true}, g < 256 || (g & 0xff) == 0, stack, sp);
+        }
+        return true;
     }
 
     // Most significant byte first.  Each pass distributes a range from one
@@ -222,19 +294,22 @@ struct sorter {
     // Bytes every key of a range shares are stepped over without a pass.
     // Small ranges are sorted by comparison, ranges tied through all twelve
     // bytes by the multikey quicksort from there on.
-    void sort(size_t n, rtask *stack) {
-        load(0, n, 0);
+    void sort(size_t n, rtask *stack, uint32_t *wide) {
+        const unsigned d0 = load_all(n);
         size_t sp = 0;
-        stack[sp++] = {0, n, 0, false};
-        size_t count[256], next[256];
+        if (n <= kRadixMin) {
+            insertion(a, 0, n, 0);
+            return;
+        }
+        if (!(wide && d0 + 1 < kKeyBytes && wide_pass(n, d0, wide, stack, sp))) stack[sp++] = {0, n, d0, false};
+        // Zero between ranges: a range clears only the buckets its bytes
+        // fell in, so the many small ranges near the leaves (ten digits
+        // each, say) do not pay for all 256.
+        size_t count[256] = {}, next[256];
         while (sp) {
             rtask t = stack[--sp];
             skey *src = t.in_b ? b : a, *dst = t.in_b ? a : b;
             for (;;) {
-                if (t.n <= kRadixMin) {  // only the whole array comes here small
-                    insertion(src, t.lo, t.n, 0);
-                    break;
-                }
                 if (t.d >= kKeyBytes) {
                     settle(t);
                     // Equal texts are in entry order already.
@@ -244,31 +319,38 @@ struct sorter {
                     }
                     break;
                 }
-                std::memset(count, 0, sizeof count);
-                for (size_t j = t.lo; j < t.lo + t.n; ++j) ++count[byte_at(src[j], t.d)];
-                if (count[byte_at(src[t.lo], t.d)] == t.n) {
+                unsigned first = 255, last = 0;
+                for (size_t j = t.lo; j < t.lo + t.n; ++j) {
+                    const unsigned c = byte_at(src[j], t.d);
+                    ++count[c];
+                    first = c < first ? c : first;
+                    last = c > last ? c : last;
+                }
+                if (t.n <= kRadixMin && last - first >= t.n) {
+                    for (unsigned c = first; c <= last; ++c) count[c] = 0;
+                    insertion(src, t.lo, t.n, 0);
+                    settle(t);
+                    break;
+                }
+                if (first == last) {
                     // One shared byte: find in one pass how many the whole
                     // range shares ("user0..." shares five), rather than a
                     // counting pass for each.
+                    count[first] = 0;
                     t.d = shared_bytes(src, t.lo, t.n, t.d + 1);
                     continue;
                 }
-                for (size_t c = 0, at = t.lo; c < 256; ++c) {
+                for (size_t c = first, at = t.lo; c <= last; ++c) {
                     next[c] = at;
                     at += count[c];
                 }
                 for (size_t j = t.lo; j < t.lo + t.n; ++j) dst[next[byte_at(src[j], t.d)]++] = src[j];
-                for (unsigned c = 0; c < 256; ++c) {
-                    if (!count[c]) continue;
-                    const rtask sub{next[c] - count[c], count[c], t.d + 1, !t.in_b};
-                    // Bucket 0 holds identifiers that end here (none holds a
-                    // NUL): equal texts, in entry order.
-                    if (c != 0 && sub.n > kRadixMin) {
-                        stack[sp++] = sub;
-                        continue;
-                    }
-                    if (c != 0) insertion(dst, sub.lo, sub.n, 0);
-                    settle(sub);
+                for (unsigned c = first; c <= last; ++c) {
+                    const size_t m = count[c];
+                    count[c] = 0;
+                    // Bucket 0 holds identifiers that end here (none holds
+                    // a NUL).
+                    if (m) take_bucket({next[c] - m, m, t.d + 1, !t.in_b}, c == 0, stack, sp);
                 }
                 break;
             }
@@ -278,11 +360,17 @@ struct sorter {
 
 }  // namespace
 
-size_t acl__sort_area_bytes(size_t n) { return 2 * n * sizeof(skey) + radix_stack(n) * sizeof(rtask); }
+size_t acl__sort_area_bytes(size_t n) {
+    return 2 * n * sizeof(skey) + radix_stack(n) * sizeof(rtask) + wide_bytes(n);
+}
 
-size_t acl__sort_max_keys() { return (SIZE_MAX - radix_stack(SIZE_MAX) * sizeof(rtask)) / (2 * sizeof(skey)); }
+size_t acl__sort_max_keys() {
+    return (SIZE_MAX - radix_stack(SIZE_MAX) * sizeof(rtask) - wide_bytes(SIZE_MAX)) / (2 * sizeof(skey));
+}
 
 void acl__sort_ids(acl__sort_key *keys, size_t n, const acl__id_table &ids) {
     if (n < 2) return;
-    sorter{keys, keys + n, ids}.sort(n, reinterpret_cast<rtask *>(keys + 2 * n));
+    auto *stack = reinterpret_cast<rtask *>(keys + 2 * n);
+    auto *wide = wide_bytes(n) ? reinterpret_cast<uint32_t *>(stack + radix_stack(n)) : nullptr;
+    sorter{keys, keys + n, ids}.sort(n, stack, wide);
 }
