@@ -57,6 +57,11 @@ struct sec_acltree_s {
         uint32_t sorted_upto;  // entries [0, sorted_upto) ascend strictly
         uint32_t first_live;   // no present entry before it; only moves forward
         bool descending;       // every entry so far descends strictly
+        // The arena is the text the entries were parsed from, which the
+        // tree does not own (arena_len and arena_cap are then 0): a
+        // million identifiers are not copied and their pages not touched
+        // again.  An entry from anywhere else ends it (unborrow).
+        bool borrowed;
     };
 
     // Null while the tree holds only the entry it was created with; then
@@ -66,6 +71,10 @@ struct sec_acltree_s {
     ent e0;  // that entry, while big is null
     unsigned char type;
     unsigned char mechlen;  // length of mech0
+    // e0's identifier came from a text the trees borrow from, at e0_text_off
+    // (its inline copy serves until the tree grows).
+    bool e0_in_text;
+    uint32_t e0_text_off;
     // Followed in the same block by the big_part (once there is one), then
     // mech0 (the first entry's mechanism spelling, "" for types without
     // one) and its NUL, then, while big is null, the first entry's
@@ -299,14 +308,15 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
 void free_big(big_part *b) {
     if (!b) return;
     std::free(b->ents);
-    std::free(b->arena);
+    if (!b->borrowed) std::free(b->arena);
     std::free(b->idx);
 }
 
 // Move a one-entry tree to the growable form, with room for `more` further
-// entries and `bytes` further arena bytes.  The block is reallocated, so
-// the link to the tree is updated.
-int32_t promote(tree **node, size_t more, size_t bytes) {
+// entries and `bytes` further arena bytes; one whose entry came from `text`
+// borrows that text as its arena.  The block is reallocated, so the link to
+// the tree is updated.
+int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullptr) {
     static_assert(sizeof(tree) % alignof(big_part) == 0, "big_part follows the header");
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
@@ -318,11 +328,13 @@ int32_t promote(tree **node, size_t more, size_t bytes) {
     // room for several, so a small tree is not reallocated at every step.
     bool ok = acl__grow(&nb.ents, &nb.cap, more >= UINT32_MAX ? UINT32_MAX : (more < 7 ? 8 : 1 + more), &failed);
     size_t want = inl + bytes < 256 ? 256 : inl + bytes;
-    if (ok) ok = acl__grow(&nb.arena, &nb.arena_cap,
-                            want > UINT32_MAX ? UINT32_MAX : want, &failed);
+    nb.borrowed = text && t->e0_in_text;
+    if (ok && !nb.borrowed) ok = acl__grow(&nb.arena, &nb.arena_cap,
+                                          want > UINT32_MAX ? UINT32_MAX : want, &failed);
     tree *nt = nullptr;
     if (ok) {
-        std::memcpy(nb.arena, inline_bytes(t), inl);
+        if (nb.borrowed) nb.arena = const_cast<char *>(text);  // never written through
+        else std::memcpy(nb.arena, inline_bytes(t), inl);
         nt = static_cast<tree *>(acl__realloc(t, sizeof(tree) + sizeof(big_part) + keep));
         if (!nt) failed = sizeof(tree) + sizeof(big_part) + keep;
     }
@@ -332,8 +344,9 @@ int32_t promote(tree **node, size_t more, size_t bytes) {
     }
     char *base = reinterpret_cast<char *>(nt) + sizeof(tree);
     std::memmove(base + sizeof(big_part), base, keep);  // mech0 moves behind the big_part
-    nb.arena_len = static_cast<uint32_t>(inl);
+    nb.arena_len = nb.borrowed ? 0 : static_cast<uint32_t>(inl);
     nb.ents[0] = nt->e0;
+    if (nb.borrowed) nb.ents[0].id_off = nt->e0_text_off;
     nb.n = 1;
     nb.n_present = (nt->e0.flags & kPresent) ? 1 : 0;
     nb.sorted_upto = 1;
@@ -341,6 +354,30 @@ int32_t promote(tree **node, size_t more, size_t bytes) {
     nt->big = reinterpret_cast<big_part *>(base);
     std::memcpy(static_cast<void *>(nt->big), &nb, sizeof nb);
     *node = nt;
+    return 0;
+}
+
+// Give a tree that borrows its identifiers an arena of its own, for an
+// entry that does not come from the borrowed text.
+int32_t unborrow(big_part *b) {
+    size_t bytes = 0;
+    for (uint32_t i = 0; i < b->n; ++i) bytes += size_t{b->ents[i].id_len} + 1;
+    if (bytes > UINT32_MAX) return no_memory("sec__add_acle_to_tree", SIZE_MAX);
+    uint32_t cap = 0;
+    char *arena = nullptr;
+    size_t failed = 0;
+    if (!acl__grow(&arena, &cap, bytes, &failed)) return no_memory("sec__add_acle_to_tree", failed);
+    uint32_t at = 0;
+    for (uint32_t i = 0; i < b->n; ++i) {
+        ent &e = b->ents[i];
+        std::memcpy(arena + at, b->arena + e.id_off, size_t{e.id_len} + 1);
+        e.id_off = at;
+        at += e.id_len + 1;
+    }
+    b->arena = arena;
+    b->arena_len = at;
+    b->arena_cap = cap;
+    b->borrowed = false;
     return 0;
 }
 
@@ -396,6 +433,8 @@ int32_t create(const new_entry &ne, tree **node) {
     t->big = nullptr;
     t->type = ne.type;
     t->mechlen = static_cast<unsigned char>(mechlen);
+    t->e0_in_text = ne.text != nullptr;
+    t->e0_text_off = ne.text ? static_cast<uint32_t>(ne.id - ne.text) : 0;
     char *p = inline_bytes(t);
     std::memcpy(p, ne.mech, mechlen);
     p[mechlen] = '\0';
@@ -444,18 +483,27 @@ bool small_matches(const tree *t, const new_entry &ne) {
     return t->e0.id_len == ne.idlen && fold_eq(inline_bytes(t) + t->e0.id_off, ne.id, ne.idlen);
 }
 
-int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
+// Whether the mechanism is spelt as the tree's first entry spells it (the
+// two are known to be equal but for case).  A few bytes: no call.
+bool same_spelling(const tree *t, const char *mech) {
+    const char *m0 = inline_bytes(t);
+    for (unsigned k = 0; k < t->mechlen; ++k)
+        if (m0[k] != mech[k]) return false;
+    return true;
+}
+
+// `held`: the caller has checked that the tree is the entry's sub-ACL's.
+int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held = false) {
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
     if (!t) return create(ne, node);
-    if (t->type != ne.type || (has_mech(t->type) && (ne.mechlen != t->mechlen ||
-                                                     !fold_eq(inline_bytes(t), ne.mech, ne.mechlen))))
+    if (!held && !acl__tree_holds(t, ne.type, ne.mech, ne.mechlen))
         return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, ne.type);
 
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
             return duplicate(single, ne, t->e0);
-        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1)) return rc;
+        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1, ne.text)) return rc;
         t = *node;
     }
     big_part *b = t->big;
@@ -487,11 +535,14 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     }
 
     // A new entry: make room everywhere before changing anything.
-    const bool own = has_mech(t->type) && std::memcmp(ne.mech, inline_bytes(t), t->mechlen) != 0;
-    const size_t add = (own ? t->mechlen + 1 : 0) + ne.idlen + 1;
+    const bool own = has_mech(t->type) && !same_spelling(t, ne.mech);
+    const bool borrow = b->borrowed && ne.text == b->arena && !own;
+    if (b->borrowed && !borrow)
+        if (int32_t rc = unborrow(b)) return rc;
+    const size_t add = borrow ? 0 : (own ? t->mechlen + 1 : 0) + ne.idlen + 1;
     if (i == UINT32_MAX || add > UINT32_MAX - size_t{b->arena_len}) return no_memory(fname, SIZE_MAX);
     if (!acl__grow(&b->ents, &b->cap, size_t{i} + 1, &failed) ||
-        !acl__grow(&b->arena, &b->arena_cap, size_t{b->arena_len} + add, &failed))
+        (!borrow && !acl__grow(&b->arena, &b->arena_cap, size_t{b->arena_len} + add, &failed)))
         return no_memory(fname, failed);
     if (b->idx && !found) {
         uint64_t *old = b->idx;
@@ -499,14 +550,18 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
         if (b->idx != old) slot = probe(b, ne, &found);
     }
 
-    char *p = b->arena + b->arena_len;
-    if (own) {
-        std::memcpy(p, ne.mech, t->mechlen);
-        p[t->mechlen] = '\0';
-        p += t->mechlen + 1;
+    const char *p = ne.id;  // where the stored identifier is
+    if (!borrow) {
+        char *q = b->arena + b->arena_len;
+        if (own) {
+            std::memcpy(q, ne.mech, t->mechlen);
+            q[t->mechlen] = '\0';
+            q += t->mechlen + 1;
+        }
+        std::memcpy(q, ne.id, ne.idlen);
+        q[ne.idlen] = '\0';
+        p = q;
     }
-    std::memcpy(p, ne.id, ne.idlen);
-    p[ne.idlen] = '\0';
     b->ents[i] = ent{static_cast<uint32_t>(p - b->arena), static_cast<uint32_t>(ne.idlen), ne.perm,
                      ne.h() | kPresent | (own ? kOwnMech : 0)};
     b->arena_len += static_cast<uint32_t>(add);
@@ -551,8 +606,22 @@ bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts) {
     return acl__valid_type(acle->type);
 }
 
+void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts) {
+    *parts = acl__entry_parts{};
+    parts->type = acle.type;
+    parts->perm = acle.perm;
+    parts->mech = has_mech(acle.type) ? acle.mech : "";
+    parts->mechlen = has_mech(acle.type) ? mechlen : 0;
+    parts->id = has_id(acle.type) && acle.id ? acle.id : "";
+    parts->idlen = has_id(acle.type) && acle.id ? idlen : 0;
+}
+
 int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts) {
     return insert(single, new_entry(parts), node);
+}
+
+int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts) {
+    return insert(single, new_entry(parts), node, true);
 }
 
 bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mech, size_t mechlen) {
@@ -579,7 +648,7 @@ void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
         __builtin_prefetch(&b->ents[b->n - 1]);
     }
     __builtin_prefetch(b->ents + b->n, 1);
-    __builtin_prefetch(b->arena + b->arena_len, 1);
+    if (!b->borrowed) __builtin_prefetch(b->arena + b->arena_len, 1);
 }
 
 uint32_t acl__tree_key_hash(const sec_acltree_s *t) {
@@ -603,6 +672,8 @@ int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
     if (!t) return 0;
     if (!t->big) return promote(node, entries, bytes);
     big_part *b = t->big;
+    if (b->borrowed)
+        if (int32_t rc = unborrow(b)) return rc;
     size_t failed = 0;
     size_t ne = size_t{b->n} + entries, nb = size_t{b->arena_len} + bytes;
     if (ne > UINT32_MAX) ne = UINT32_MAX;
