@@ -24,6 +24,7 @@
 
 struct sec_acltree_s;
 struct acl__entry_parts;
+struct acl__pool;
 typedef sec_acltree_s *sec_acltree_t;
 
 // The growable array of trees of an ACL under construction, one slot per
@@ -133,8 +134,11 @@ bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts);
 void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts);
 // acl__tree_insert with the entry as parts.
 int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts);
-// The same for a tree that acl__tree_holds has just said is the entry's.
-int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts);
+// The same for a tree that acl__tree_holds has just said is the entry's
+// (or null: a new one), its small blocks taken from `pool` (null: the
+// heap).  A tree with pooled blocks must be freed before the pool.
+int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
+                              acl__pool *pool);
 // Whether the tree is that of sub-ACL (type, mechanism): the key it was
 // created with, the mechanism compared case-insensitively.
 bool acl__tree_holds(const sec_acltree_s *tree, unsigned char type, const char *mech, size_t mechlen);

@@ -27,6 +27,7 @@ struct trees_index {
     size_t cap;   // capacity of the trees array
     int32_t last; // slot of the previous insertion, checked first
     uint32_t last_hash;  // its key's hash
+    acl__pool pool;      // the trees' small blocks
 };
 
 void index_put(trees_index *x, uint64_t v) {
@@ -160,7 +161,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     if (found >= 0) {
         x->last = found;
         x->last_hash = h;
-        return acl__tree_insert_held(&trees->trees[found], 1, ne);
+        return acl__tree_insert_held(&trees->trees[found], 1, ne, &x->pool);
     }
 
     // A new sub-ACL: grow the index and the array first, so a failure
@@ -180,7 +181,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     trees->trees[slot] = nullptr;
     // When the first entry cannot be stored the slot stays, counted and
     // empty, and out of the index.
-    int32_t rc = acl__tree_insert_parts(&trees->trees[slot], 1, ne);
+    int32_t rc = acl__tree_insert_held(&trees->trees[slot], 1, ne, &x->pool);
     if (rc) return rc;
     index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
     ++x->used;
@@ -197,6 +198,7 @@ void acl__free_trees(acl__trees_s *trees) {
     }
     std::free(trees->trees);
     if (auto *x = static_cast<trees_index *>(trees->index)) {
+        acl__pool_release(&x->pool);  // after the trees whose blocks it holds
         std::free(x->slots);
         std::free(x);
     }
