@@ -69,7 +69,7 @@ private:
 thread_local class_table t_classes;
 
 struct classifier {
-    const unsigned char *c = t_classes.current();
+    const unsigned char *c;
 
     bool token(unsigned char b) const { return c[b] & C_TOKEN; }
     bool blank(unsigned char b) const { return c[b] & C_BLANK; }
@@ -85,6 +85,7 @@ struct line_parser {
     unsigned char *p;                // next byte to look at, never past the line's end
     unsigned char *end = nullptr;    // the line's terminator, once met
     bool last = false;               // the line ends at a NUL
+    size_t mechlen = 0, idlen = 0;   // of the entry's mechanism and identifier
 
     // A token runs up to its first non-token byte, which becomes its NUL.
     struct token {
@@ -174,10 +175,12 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
     t = lp.read_token();
     if (type == SEC_ACLE_TYPE_GROUP) {
         acle->id = t.s;
+        lp.idlen = t.len;
     } else {
+        lp.mechlen = t.len;
         if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, acl::msg::LINE_MECH_TOO_LONG.num, t.s};
         for (size_t i = 0; i < t.len; ++i) {
-            t.s[i] = static_cast<char>(zo_tolower_posix_1(static_cast<unsigned char>(t.s[i])));
+            t.s[i] = static_cast<char>(zo::fold(static_cast<unsigned char>(t.s[i])));
             acle->mech[i] = t.s[i];
         }
     }
@@ -187,14 +190,17 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
 
     t = lp.read_token();
     acle->id = t.s;
+    lp.idlen = t.len;
     if (t.ends_line || lp.at_end_mark()) return {};
     return permissions(lp, permset, acle);
 }
 
 }  // namespace
 
+const unsigned char *acl__line_classes() { return t_classes.current(); }
+
 int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
-                                sec_acle_t acle, acl__line_fault *out) {
+                                sec_acle_t acle, acl__line_fault *out, acl__line_ctx *ctx) {
     std::memset(acle, 0, sizeof *acle);
     char *const start = *tacl;
     const size_t remaining = *length;
@@ -214,8 +220,13 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
         if (remaining == 1) return 0;
         if (!permset) permset = &acl__default_perm_set;
 
-        line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
+        line_parser lp{classifier{ctx && ctx->classes ? ctx->classes : acl__line_classes()},
+                       reinterpret_cast<unsigned char *>(start)};
         f = parse_entry(lp, permset, acle);
+        if (ctx) {
+            ctx->mechlen = lp.mechlen;
+            ctx->idlen = lp.idlen;
+        }
         lp.find_end();
 
         consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;
