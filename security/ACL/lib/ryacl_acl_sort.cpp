@@ -91,9 +91,21 @@ struct sorter {
     const char *text(uint32_t i) const { return ids.arena + ref(i, 0); }
     size_t length(uint32_t i) const { return ref(i, 1); }
 
-    // Keys of a[lo, lo + n) from `depth` on.
+    // Keys of a[lo, lo + n) from `depth` on.  The texts may lie anywhere
+    // (the entries of one sub-ACL are spread through the file they were
+    // parsed from): fetched ahead, their misses overlap.
     void load(size_t lo, size_t n, size_t depth) {
+        constexpr size_t kAhead = 8;
+        auto fetch = [&](size_t j) {
+            const size_t len = length(a[j].i);
+            if (depth >= len) return;
+            const char *s = text(a[j].i);
+            __builtin_prefetch(s + depth);
+            __builtin_prefetch(s + (len - depth > kKeyBytes ? depth + kKeyBytes : len));
+        };
+        for (size_t j = lo; j < lo + n && j < lo + kAhead; ++j) fetch(j);
         for (size_t j = lo; j < lo + n; ++j) {
+            if (j + kAhead < lo + n) fetch(j + kAhead);
             const char *s = text(a[j].i);
             const size_t len = length(a[j].i);
             a[j].k = chunk(s, len, depth);
@@ -103,11 +115,10 @@ struct sorter {
     // Keys of the whole array from depth 0, and how many bytes of them all
     // keys share, found on the way rather than by a pass of its own.
     unsigned load_all(size_t n) {
-        load(0, 1, 0);
+        load(0, n, 0);
         uint64_t dk = 0;
         uint32_t dk2 = 0;
         for (size_t j = 1; j < n; ++j) {
-            load(j, 1, 0);
             dk |= a[j].k ^ a[0].k;
             dk2 |= a[j].k2 ^ a[0].k2;
         }

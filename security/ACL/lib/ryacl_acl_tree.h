@@ -84,6 +84,12 @@ typedef bool (*acl__tree_visit_fn)(const acl__tree_entry_view *e, void *ctx);
 int32_t acl__tree_visit(sec_acltree_s *tree, acl__tree_visit_fn fn, void *ctx);
 // The same, naming `fname` in message 89.
 int32_t acl__tree_visit_named(sec_acltree_s *tree, acl__tree_visit_fn fn, void *ctx, const char *fname);
+// Fetch into the cache, without waiting, what sizing and visiting a tree
+// read first, one step of the chain at a time: stage 0 the tree's own
+// block, 1 its entries, 2 the texts of its first identifiers.  Each stage
+// reads what the one before fetched, so a caller going through many trees
+// calls the stages a few trees apart.  Null is accepted.
+void acl__tree_visit_prefetch(const sec_acltree_s *tree, int stage);
 
 // Insert an entry given as parts, for reading a sub-ACL back without a
 // temporary record.  mech (types 4, 8) and id (types 4, 8, 16) must be
