@@ -70,11 +70,40 @@ TEST(AclSort, AgreesWithTheFoldedCompareAndKeepsEntryOrderOnTies) {
     // for ranges to be split at several depths and moved back and forth
     // between the two halves of the work area; prefixes that end before,
     // at and beyond the twelve bytes of a key.
-    for (size_t n : {2u, 17u, 63u, 300u, 5000u})
+    // 40,000 are distributed on two bytes at once, first beyond the cache,
+    // then within it, texts ending inside either byte.
+    for (size_t n : {2u, 17u, 63u, 300u, 5000u, 40000u})
         for (size_t shared : {0u, 7u, 11u, 12u, 13u, 17u, 30u}) {
             const std::vector<std::string> ids = identifiers(n, shared, static_cast<unsigned>(n + shared));
             EXPECT_EQ(sorted_by_sort(ids), sorted_plainly(ids)) << n << " identifiers, prefix " << shared;
         }
+}
+
+TEST(AclSort, TwoBytePassesThatDoNotPay) {
+    std::mt19937 rng(5);
+    auto any_bytes = [&](std::string &s, size_t most) {
+        for (size_t k = rng() % (most + 1); k > 0; --k) s += static_cast<char>(1 + rng() % 255);
+    };
+    // The first two bytes take over a thousand values: too many for one
+    // pass over a range beyond the cache, which goes one byte at a time;
+    // within each of its ranges the next two take few enough for one.
+    std::vector<std::string> spread;
+    for (size_t i = 0; i < 200000; ++i) {
+        std::string s{("aBc[\xc3xYz0~m\x7f" "12345678")[rng() % 20], static_cast<char>(1 + rng() % 64), "qQ_"[rng() % 3]};
+        any_bytes(s, 3);
+        spread.push_back(s);
+    }
+    EXPECT_EQ(sorted_by_sort(spread), sorted_plainly(spread)) << "two bytes of thousands of values";
+
+    // Within each range of a two-byte pass, the next two bytes (and no
+    // more) are the same in every key.
+    std::vector<std::string> shared_pair;
+    for (size_t i = 0; i < 40000; ++i) {
+        std::string s = std::string("u") + "aBc[\xc3xYz"[rng() % 8] + "cDe";
+        any_bytes(s, 4);
+        shared_pair.push_back(s);
+    }
+    EXPECT_EQ(sorted_by_sort(shared_pair), sorted_plainly(shared_pair)) << "a shared pair of bytes";
 }
 
 TEST(AclSort, ManyEqualTextsAndOrderedInputs) {

@@ -55,25 +55,30 @@ struct rtask {
 // are keys (the digits of "user0000123" do).
 constexpr size_t kLeafMax = 8;
 constexpr size_t kRadixMin = 32;
-// The first pass over a large array may distribute on two bytes at once:
-// a million identifiers sharing "user" then fall into a hundred ranges of
-// ten thousand that sort in cache, where one byte leaves ten of a hundred
-// thousand for another pass through memory.  Only while the two bytes take
-// few values: scattered over thousands of places, the moves of a pass
-// would each miss the cache.
-constexpr size_t kWideMin = size_t{1} << 16;
+// A range may be distributed on two bytes at once: a million identifiers
+// sharing "user" then fall into a hundred ranges of ten thousand that sort
+// in cache, where one byte leaves ten of a hundred thousand for another
+// pass through memory, and each range of ten thousand again needs two
+// passes, not four.  Only while the two bytes take few values: over a
+// range larger than the cache, moves scattered to thousands of places
+// would each miss it; and counting them must not cost more than the keys.
+constexpr size_t kWideMin = 8192;         // arrays given the two-byte counters
+constexpr size_t kWideRange = 2048;       // ranges worth a two-byte count
+constexpr size_t kWideInCache = 32768;    // keys of a range that stays in cache
 constexpr size_t kWideDigits = size_t{1} << 16;
-constexpr size_t kWideMaxUsed = 1024;
-// Ranges waiting: those of the first pass, at most 255 at each further
-// level, and, since each holds more than kLeafMax keys of its own, at most
+constexpr size_t kWideMaxUsed = 4096;     // values taken, in cache
+constexpr size_t kWideMaxUsedFar = 1024;  // beyond it
+// Ranges waiting: at most kWideMaxUsed from each of twelve levels, and,
+// since each holds more than kLeafMax keys of its own, at most
 // n / (kLeafMax + 1).  Sized by n, the area of a small tree stays small: a
 // million-entry file of 65,534 sub-ACLs sorts each one in a block the
 // allocator recycles without consolidating its free lists every time.
 size_t radix_stack(size_t n) {
-    const size_t by_levels = kWideMaxUsed + kKeyBytes * 255 + 1, by_keys = n / (kLeafMax + 1) + 1;
+    const size_t by_levels = kKeyBytes * kWideMaxUsed + 1, by_keys = n / (kLeafMax + 1) + 1;
     return by_keys < by_levels ? by_keys : by_levels;
 }
-// Counters of the two-byte pass, behind the stack.
+// Counters of the two-byte passes, behind the stack; positions in them are
+// 32-bit.
 size_t wide_bytes(size_t n) {
     return n >= kWideMin && n <= UINT32_MAX ? kWideDigits * sizeof(uint32_t) : 0;
 }
@@ -91,10 +96,11 @@ struct sorter {
     const char *text(uint32_t i) const { return ids.arena + ref(i, 0); }
     size_t length(uint32_t i) const { return ref(i, 1); }
 
-    // Keys of a[lo, lo + n) from `depth` on.  The texts may lie anywhere
-    // (the entries of one sub-ACL are spread through the file they were
-    // parsed from): fetched ahead, their misses overlap.
-    void load(size_t lo, size_t n, size_t depth) {
+    // Keys of a[lo, lo + n) from `depth` on, and how many bytes of them
+    // all keys share (12: all).  The texts may lie anywhere (the entries of
+    // one sub-ACL are spread through the file they were parsed from):
+    // fetched ahead, their misses overlap.
+    unsigned load(size_t lo, size_t n, size_t depth) {
         constexpr size_t kAhead = 8;
         auto fetch = [&](size_t j) {
             const size_t len = length(a[j].i);
@@ -104,23 +110,16 @@ struct sorter {
             __builtin_prefetch(s + (len - depth > kKeyBytes ? depth + kKeyBytes : len));
         };
         for (size_t j = lo; j < lo + n && j < lo + kAhead; ++j) fetch(j);
+        uint64_t dk = 0;
+        uint32_t dk2 = 0;
         for (size_t j = lo; j < lo + n; ++j) {
             if (j + kAhead < lo + n) fetch(j + kAhead);
             const char *s = text(a[j].i);
             const size_t len = length(a[j].i);
             a[j].k = chunk(s, len, depth);
             a[j].k2 = static_cast<uint32_t>(chunk(s, len, depth + 8) >> 32);
-        }
-    }
-    // Keys of the whole array from depth 0, and how many bytes of them all
-    // keys share, found on the way rather than by a pass of its own.
-    unsigned load_all(size_t n) {
-        load(0, n, 0);
-        uint64_t dk = 0;
-        uint32_t dk2 = 0;
-        for (size_t j = 1; j < n; ++j) {
-            dk |= a[j].k ^ a[0].k;
-            dk2 |= a[j].k2 ^ a[0].k2;
+            dk |= a[j].k ^ a[lo].k;
+            dk2 |= a[j].k2 ^ a[lo].k2;
         }
         return differing_from(dk, dk2);
     }
@@ -272,29 +271,52 @@ struct sorter {
         settle(sub);
     }
 
-    // The first pass on the two bytes from d of the whole array, when they
-    // take few enough values; false, and nothing moved, when they do not.
-    bool wide_pass(size_t n, unsigned d, uint32_t *count, rtask *stack, size_t &sp) {
-        std::memset(count, 0, kWideDigits * sizeof *count);
+    // One pass on the two bytes from t.d of a range of at least kWideRange
+    // keys: 1 done, 0 when they take too many values (nothing moved), -1
+    // when every key shares them (t.d moved past what they all share).
+    // `wide` is zero on entry and on return.
+    int wide_pass(rtask &t, uint32_t *wide, rtask *stack, size_t &sp) {
+        skey *src = t.in_b ? b : a, *dst = t.in_b ? a : b;
+        const unsigned d = t.d;
         auto digit = [d](const skey &x) { return byte_at(x, d) << 8 | byte_at(x, d + 1); };
-        for (size_t j = 0; j < n; ++j) ++count[digit(a[j])];
+        unsigned first = kWideDigits - 1, last = 0;
+        for (size_t j = t.lo; j < t.lo + t.n; ++j) {
+            const unsigned g = digit(src[j]);
+            ++wide[g];
+            first = g < first ? g : first;
+            last = g > last ? g : last;
+        }
+        if (first == last) {
+            wide[first] = 0;
+            t.d = shared_bytes(src, t.lo, t.n, d + 2);
+            return -1;
+        }
+        const size_t max_used = t.n <= kWideInCache ? kWideMaxUsed : kWideMaxUsedFar;
         size_t used = 0;
-        for (size_t g = 0; g < kWideDigits; ++g) used += count[g] != 0;
-        if (used > kWideMaxUsed) return false;
+        if (last - first < 2 * t.n)
+            for (unsigned g = first; g <= last; ++g) used += wide[g] != 0;
+        if (used == 0 || used > max_used) {
+            std::memset(wide + first, 0, (last - first + 1) * sizeof *wide);
+            return 0;
+        }
         // Starts, then (after the moves) ends of the buckets.
-        uint32_t at = 0;
-        for (size_t g = 0; g < kWideDigits; ++g) {
-            const uint32_t m = count[g];
-            count[g] = at;
+        uint32_t at = static_cast<uint32_t>(t.lo);
+        for (unsigned g = first; g <= last; ++g) {
+            const uint32_t m = wide[g];
+            wide[g] = at;
             at += m;
         }
-        for (size_t j = 0; j < n; ++j) b[count[digit(a[j])]++] = a[j];
-        for (size_t g = 0, lo = 0; g < kWideDigits; lo = count[g++]) {
-            if (count[g] == lo) continue;
+        for (size_t j = t.lo; j < t.lo + t.n; ++j) dst[wide[digit(src[j])]++] = src[j];
+        size_t lo = t.lo;
+        for (unsigned g = first; g <= last; ++g) {
+            const size_t end = wide[g];
+            wide[g] = 0;
+            if (end == lo) continue;
             // A zero byte: the texts ended at byte d or d + 1.
-            take_bucket({lo, count[g] - lo, d + 2, true}, g < 256 || (g & 0xff) == 0, stack, sp);
+            take_bucket({lo, end - lo, d + 2, !t.in_b}, g < 256 || (g & 0xff) == 0, stack, sp);
+            lo = end;
         }
-        return true;
+        return 1;
     }
 
     // Most significant byte first.  Each pass distributes a range from one
@@ -306,13 +328,14 @@ struct sorter {
     // Small ranges are sorted by comparison, ranges tied through all twelve
     // bytes by the multikey quicksort from there on.
     void sort(size_t n, rtask *stack, uint32_t *wide) {
-        const unsigned d0 = load_all(n);
+        const unsigned d0 = load(0, n, 0);
         size_t sp = 0;
         if (n <= kRadixMin) {
             insertion(a, 0, n, 0);
             return;
         }
-        if (!(wide && d0 + 1 < kKeyBytes && wide_pass(n, d0, wide, stack, sp))) stack[sp++] = {0, n, d0, false};
+        stack[sp++] = {0, n, d0, false};
+        if (wide) std::memset(wide, 0, kWideDigits * sizeof *wide);
         // Zero between ranges: a range clears only the buckets its bytes
         // fell in, so the many small ranges near the leaves (ten digits
         // each, say) do not pay for all 256.
@@ -329,6 +352,11 @@ struct sorter {
                         quicksort(t.lo, t.n, kKeyBytes);
                     }
                     break;
+                }
+                if (wide && t.n >= kWideRange && t.d + 1 < kKeyBytes) {
+                    const int w = wide_pass(t, wide, stack, sp);
+                    if (w > 0) break;
+                    if (w < 0) continue;
                 }
                 unsigned first = 255, last = 0;
                 for (size_t j = t.lo; j < t.lo + t.n; ++j) {
