@@ -1,6 +1,7 @@
 // The ACL text parser: one line per call, in place, no allocation.
 #include <langinfo.h>
 
+#include <bit>
 #include <cctype>
 #include <clocale>
 #include <cstdint>
@@ -83,6 +84,7 @@ struct classifier {
 struct line_parser {
     classifier cl;
     unsigned char *p;                // next byte to look at, never past the line's end
+    const unsigned char *limit;      // the text's end, just past its final NUL
     unsigned char *end = nullptr;    // the line's terminator, once met
     bool last = false;               // the line ends at a NUL
     size_t mechlen = 0, idlen = 0;   // of the entry's mechanism and identifier
@@ -101,9 +103,31 @@ struct line_parser {
         last = *at == '\0';
     }
 
+    // Past the token bytes at p.  Eight bytes at a time while they are
+    // plainly token bytes (0x21 to 0x7f, whatever the locale), each other
+    // byte asked of the table; never a load past the text's end.
+    void skip_token() {
+        if constexpr (std::endian::native == std::endian::little) {
+            while (p + 8 <= limit) {
+                const uint64_t x = zo::load8(reinterpret_cast<const char *>(p));
+                // High bit of each byte below 0x21 or above 0x7f; exact up
+                // to the first such byte, which is all that is used.
+                const uint64_t m = ((x - 0x2121212121212121ull) | x) & 0x8080808080808080ull;
+                if (!m) {
+                    p += 8;
+                    continue;
+                }
+                p += std::countr_zero(m) / 8;
+                if (!cl.token(*p)) return;
+                ++p;
+            }
+        }
+        while (cl.token(*p)) ++p;
+    }
+
     token read_token() {
         unsigned char *s = p;
-        while (cl.token(*p)) ++p;
+        skip_token();
         token t{reinterpret_cast<char *>(s), static_cast<size_t>(p - s), cl.line_end(*p)};
         if (t.ends_line) note_end(p);
         *p = '\0';
@@ -221,7 +245,8 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
         if (!permset) permset = &acl__default_perm_set;
 
         line_parser lp{classifier{ctx && ctx->classes ? ctx->classes : acl__line_classes()},
-                       reinterpret_cast<unsigned char *>(start)};
+                       reinterpret_cast<unsigned char *>(start),
+                       reinterpret_cast<const unsigned char *>(start) + remaining};
         f = parse_entry(lp, permset, acle);
         if (ctx) {
             ctx->mechlen = lp.mechlen;

@@ -78,9 +78,10 @@ void acl__advise_large(void *p, size_t n) {
 #endif
 }
 
-void *acl__pool_alloc(acl__pool *pool, size_t n) {
+void *acl__pool_alloc(acl__pool *pool, size_t n, size_t align) {
     n = (n + 15) & ~size_t{15};
-    if (static_cast<size_t>(pool->end - pool->at) < n) {
+    const auto skip = [&] { return (align - reinterpret_cast<uintptr_t>(pool->at) % align) % align; };
+    if (!pool->at || static_cast<size_t>(pool->end - pool->at) < n + skip()) {
         // Chunks double from 64 KiB to 4 MiB: a small ACL stays small, a
         // large one makes few chunks, advised into huge pages.
         constexpr size_t kFirst = size_t{64} << 10, kLast = size_t{4} << 20, kHead = 16;
@@ -94,6 +95,7 @@ void *acl__pool_alloc(acl__pool *pool, size_t n) {
         pool->end = c + size;
         pool->next_size = size < kLast ? size * 2 : kLast;
     }
+    pool->at += skip();
     void *r = pool->at;
     pool->at += n;
     return r;

@@ -43,9 +43,10 @@ struct acl__pool {
 // Blocks larger than this are not worth pooling: callers take them from
 // the heap, where they can grow in place.
 constexpr size_t acl__pool_max_block = 4096;
-// n bytes (at most acl__pool_max_block) from the pool; null when a chunk
-// cannot be had (nothing recorded).
-void *acl__pool_alloc(acl__pool *pool, size_t n);
+// n bytes (at most acl__pool_max_block) from the pool, aligned to `align`
+// (16 or 64: a block that starts a cache line spans the fewest); null when
+// a chunk cannot be had (nothing recorded).
+void *acl__pool_alloc(acl__pool *pool, size_t n, size_t align = 16);
 // Release every chunk; the pool is empty and usable again.
 void acl__pool_release(acl__pool *pool);
 
