@@ -219,7 +219,7 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
     // each costing a full trip to memory.  An identifier's entry is fetched
     // first, its text (both ends: one in two crosses a cache line) once
     // the entry has arrived.
-    constexpr size_t kAhead = 16;
+    constexpr size_t kAhead = 32;
     uint32_t i = 0;
     size_t j = 0;
     for (;;) {
