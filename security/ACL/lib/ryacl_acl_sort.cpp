@@ -404,7 +404,7 @@ size_t acl__sort_area_bytes(size_t n) {
 }
 
 size_t acl__sort_max_keys() {
-    return (SIZE_MAX - radix_stack(SIZE_MAX) * sizeof(rtask) - wide_bytes(SIZE_MAX)) / (2 * sizeof(skey));
+    return (SIZE_MAX - radix_stack(SIZE_MAX) * sizeof(rtask) - kWideDigits * sizeof(uint32_t)) / (2 * sizeof(skey));
 }
 
 void acl__sort_ids(acl__sort_key *keys, size_t n, const acl__id_table &ids) {
