@@ -23,6 +23,7 @@
 // written after creation, so any number of threads evaluate through it.
 #include <sys/auxv.h>
 
+#include <cstddef>
 #include <cstring>
 #ifdef __SSE2__
 #include <emmintrin.h>
@@ -95,9 +96,12 @@ uint64_t text_hash(const head32 &k, const char *p, size_t len, uint64_t seed) {
     return h;
 }
 
-// Order of two identifiers as the comparison gives it, from their heads
-// where those differ.
-inline int order(const head32 &x, const char *p, size_t plen, const head32 &y, const char *q, size_t qlen) {
+// Order of two identifiers as the comparison gives it, from the first 16
+// bytes of their heads where those differ.
+struct head16 {
+    uint64_t a, b;
+};
+inline int order(const head32 &x, const char *p, size_t plen, const head16 &y, const char *q, size_t qlen) {
     if (x.a != y.a) return __builtin_bswap64(x.a) < __builtin_bswap64(y.a) ? -1 : 1;
     if (x.b != y.b) return __builtin_bswap64(x.b) < __builtin_bswap64(y.b) ? -1 : 1;
     if (plen <= 16 && qlen <= 16) return 0;
@@ -113,8 +117,12 @@ struct id_slot {
 };
 constexpr uint32_t kReached = 1;
 
+// A table of n slots takes its home slots from the first n - kSpill: the
+// last slots are there so that the four from a home slot on always lie in
+// the table (creation reads them at once).  Probes wrap at n.
+constexpr uint32_t kSpill = 3;
 inline uint32_t slot_of(uint64_t h, uint32_t n) {
-    return static_cast<uint32_t>((static_cast<uint64_t>(static_cast<uint32_t>(h >> 32)) * n) >> 32);
+    return static_cast<uint32_t>((static_cast<uint64_t>(static_cast<uint32_t>(h >> 32)) * (n - kSpill)) >> 32);
 }
 inline bool same_key(uint32_t key, uint64_t h) { return ((key ^ static_cast<uint32_t>(h)) & ~kReached) == 0; }
 
@@ -213,7 +221,7 @@ const sub_info *find_sub(const sec_acl_index_s *ix, unsigned type, const char *m
 
 // Slots of an identifier table of n entries: loaded to at most two thirds,
 // so a miss ends within a few slots.
-inline size_t table_size(uint32_t n) { return size_t{n} + n / 2 + 1; }
+inline size_t table_size(uint32_t n) { return size_t{n} + n / 2 + 1 + kSpill; }
 
 // The header of the sub-ACL at pos keeps validation's rules: it and its
 // length lie in the block, its type is known, its mechanism field is right
@@ -371,8 +379,28 @@ inline bool same_id(const unsigned char *p, uint32_t a, uint32_t b) {
 }
 
 // Enter one entry unless an earlier entry of its identifier is there: a
-// later one is never the walk's answer.
+// later one is never the walk's answer.  The four slots from its home are
+// looked at together: when one is empty and no key before it is the
+// entry's, the entry goes there without a branch on which one (a third of
+// home slots are taken by then, at random).
 inline void insert(const unsigned char *p, id_slot *t, uint32_t n, const pending &e) {
+#ifdef __SSE2__
+    static_assert(sizeof(id_slot) == 8 && offsetof(id_slot, off) == 4 && kSpill == 3);
+    const __m128 s01 = _mm_castsi128_ps(_mm_loadu_si128(reinterpret_cast<const __m128i *>(t + e.slot)));
+    const __m128 s23 = _mm_castsi128_ps(_mm_loadu_si128(reinterpret_cast<const __m128i *>(t + e.slot + 2)));
+    const __m128i offs = _mm_castps_si128(_mm_shuffle_ps(s01, s23, _MM_SHUFFLE(3, 1, 3, 1)));
+    const __m128i keys = _mm_castps_si128(_mm_shuffle_ps(s01, s23, _MM_SHUFFLE(2, 0, 2, 0)));
+    const auto key_bits = static_cast<int>(~kReached);
+    const unsigned empty = static_cast<unsigned>(
+        _mm_movemask_ps(_mm_castsi128_ps(_mm_cmpeq_epi32(offs, _mm_setzero_si128()))));
+    const unsigned same = static_cast<unsigned>(_mm_movemask_ps(_mm_castsi128_ps(_mm_cmpeq_epi32(
+        _mm_and_si128(keys, _mm_set1_epi32(key_bits)), _mm_set1_epi32(static_cast<int>(e.key) & key_bits)))));
+    const unsigned first = static_cast<unsigned>(__builtin_ctz(empty | 16u));
+    if (first < 4 && (same & ((1u << first) - 1)) == 0) {
+        t[e.slot + first] = {e.key, e.off};
+        return;
+    }
+#endif
     for (uint32_t i = e.slot;; i = i + 1 == n ? 0 : i + 1) {
         id_slot &slot = t[i];
         if (!slot.off) {
@@ -393,7 +421,7 @@ size_t fill_entries(const unsigned char *p, size_t len, size_t pos, uint32_t cou
                     uint64_t seed, copier &c) {
     constexpr uint32_t kAhead = 16;
     pending ring[kAhead];
-    head32 top{};  // the highest identifier so far
+    head16 top{};  // the highest identifier so far
     const char *topid = nullptr;
     size_t toplen = 0;
     for (uint32_t k = 0; k < count; ++k) {
@@ -406,7 +434,7 @@ size_t fill_entries(const unsigned char *p, size_t len, size_t pos, uint32_t cou
         uint64_t h;
         if (!scan_id(id, idl, len - at, seed, &head, &h)) return 0;
         const bool reached = !topid || order(head, id, idl, top, topid, toplen) > 0;
-        if (reached) top = head, topid = id, toplen = idl;
+        if (reached) top = {head.a, head.b}, topid = id, toplen = idl;
         const uint32_t slot = slot_of(h, n);
         __builtin_prefetch(t + slot, 1);
         pending &r = ring[k % kAhead];
