@@ -5,6 +5,7 @@
 
 #include "lib_acl_bytes.h"
 #include "ryacl_acl_buffer.h"
+#include "ryacl_acl_file.h"
 #include "ryacl_acl_tree.h"
 
 namespace {
@@ -116,3 +117,52 @@ TEST(AclBuffer, LimitsAreRefusedNotWrapped) {
 }
 
 }  // namespace
+
+namespace {
+
+struct quiet_sink final : acl__text_sink {
+    void fault(int32_t, int32_t) override {}
+};
+
+// The text's entries parsed into trees, the trees keeping their identifiers
+// in the text or not.
+void parse_into(std::string &text, bool borrow, acl__trees_s *trees) {
+    acl__textfile_opts o{ACL_RC_FILE_ERROR, 0, 0, 0};
+    o.trees_borrow_text = borrow;
+    quiet_sink sink;
+    acl__parse_result res;
+    ASSERT_EQ(acl__parse_acltext(text.data(), text.size(), o, sink, trees, &res), 0);
+}
+
+}  // namespace
+
+// Trees that keep their identifiers in the parsed text compile as copying
+// ones do; an entry from elsewhere gives a tree its own copies (each
+// allocation on the way failing in turn leaves the trees as they were), after
+// which the text can go.
+TEST(AclBuffer, IdentifiersBorrowedFromTheTextUntilAnEntryComesFromElsewhere) {
+    std::string lines;
+    for (int i = 0; i < 40; ++i) lines += "u unix user" + std::to_string((i * 17) % 40) + "@Example r\n";
+    lines += "u krb lone rw\n";
+    std::string a = lines, b = lines;
+    acl__trees_s borrowed, copied;
+    parse_into(a, true, &borrowed);
+    parse_into(b, false, &copied);
+    ASSERT_EQ(borrowed.nooftrees, 2);
+    EXPECT_EQ(compile(borrowed), compile(copied));
+
+    sec_acle_desc more[] = {entry(U, 2, "unix", "zed"), entry(U, 2, "KRB", "other")};
+    for (const sec_acle_desc &m : more) {
+        auto flow = [&] { return sec__add_acle_to_trees(&m, &borrowed); };
+        auto check = [&](int32_t rc, long) {
+            EXPECT_EQ(with_msg(rc), rc_msg(ACL_RC_NO_MEMORY, 89));
+            EXPECT_EQ(compile(borrowed), compile(copied));
+        };
+        EXPECT_GE(rytest::for_each_alloc_failure(flow, check), 1);
+        ASSERT_EQ(sec__add_acle_to_trees(&m, &copied), 0);
+    }
+    std::fill(a.begin(), a.end(), 'X');  // the text's bytes reused
+    EXPECT_EQ(compile(borrowed), compile(copied));
+    acl__free_trees(&borrowed);
+    acl__free_trees(&copied);
+}

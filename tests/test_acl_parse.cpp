@@ -32,7 +32,10 @@ std::string error_word(int32_t rc) {
 // A whole text parsed into one word per line (".", "u:unix:alice:3", "E158@2"),
 // checking the cursor protocol after every call.
 std::string words_of(const std::string &text) {
-    std::vector<char> buf(text.begin(), text.end());
+    // Exactly the text and its NUL, so that a sanitizer sees any read past it.
+    std::vector<char> buf;
+    buf.reserve(text.size() + 1);
+    buf.assign(text.begin(), text.end());
     buf.push_back('\0');
     char *cur = buf.data(), *const end = buf.data() + buf.size();
     size_t len = buf.size();

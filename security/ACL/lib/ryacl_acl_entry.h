@@ -58,7 +58,19 @@ struct acl__line_fault {
 // goes to *fault and its code is returned.  The thread's error may have
 // been changed on the way (a permission letter's message) and is not the
 // line's until acl__record_line_fault is called.
+// What a caller parsing many lines passes in and gets back besides the
+// entry: the byte classes acl__line_classes returned on this thread since
+// its locale last changed (looked up once, not once per line), and the
+// lengths of the entry's mechanism and identifier (0 for none), which the
+// parser knows without counting again.
+struct acl__line_ctx {
+    const unsigned char *classes = nullptr;
+    size_t mechlen = 0;
+    size_t idlen = 0;
+};
 int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
-                                sec_acle_t acle, acl__line_fault *fault);
+                                sec_acle_t acle, acl__line_fault *fault, acl__line_ctx *ctx = nullptr);
+// The byte classes of the calling thread's locale that the parser uses.
+const unsigned char *acl__line_classes();
 // Record the report as sec__read_acle_from_text does; returns its code.
 int32_t acl__record_line_fault(const acl__line_fault &fault);

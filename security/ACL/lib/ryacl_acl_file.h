@@ -48,6 +48,9 @@ struct acl__textfile_opts {
     bool keep_going = false;         // pass over faulty lines and duplicate entries
     bool each_entry = false;         // hand every entry to the sink
     const sec_perm_set_desc *permset = nullptr;
+    // The caller frees the trees before the text: their identifiers may
+    // stay in the text rather than be copied.
+    bool trees_borrow_text = false;
 };
 
 // Where a parse sends what it meets.  The current error describes a fault

@@ -1,6 +1,7 @@
 // The ACL text parser: one line per call, in place, no allocation.
 #include <langinfo.h>
 
+#include <bit>
 #include <cctype>
 #include <clocale>
 #include <cstdint>
@@ -69,7 +70,7 @@ private:
 thread_local class_table t_classes;
 
 struct classifier {
-    const unsigned char *c = t_classes.current();
+    const unsigned char *c;
 
     bool token(unsigned char b) const { return c[b] & C_TOKEN; }
     bool blank(unsigned char b) const { return c[b] & C_BLANK; }
@@ -83,8 +84,10 @@ struct classifier {
 struct line_parser {
     classifier cl;
     unsigned char *p;                // next byte to look at, never past the line's end
+    const unsigned char *limit;      // the text's end, just past its final NUL
     unsigned char *end = nullptr;    // the line's terminator, once met
     bool last = false;               // the line ends at a NUL
+    size_t mechlen = 0, idlen = 0;   // of the entry's mechanism and identifier
 
     // A token runs up to its first non-token byte, which becomes its NUL.
     struct token {
@@ -100,9 +103,31 @@ struct line_parser {
         last = *at == '\0';
     }
 
+    // Past the token bytes at p.  Eight bytes at a time while they are
+    // plainly token bytes (0x21 to 0x7f, whatever the locale), each other
+    // byte asked of the table; never a load past the text's end.
+    void skip_token() {
+        if constexpr (std::endian::native == std::endian::little) {
+            while (p + 8 <= limit) {
+                const uint64_t x = zo::load8(reinterpret_cast<const char *>(p));
+                // High bit of each byte below 0x21 or above 0x7f; exact up
+                // to the first such byte, which is all that is used.
+                const uint64_t m = ((x - 0x2121212121212121ull) | x) & 0x8080808080808080ull;
+                if (!m) {
+                    p += 8;
+                    continue;
+                }
+                p += std::countr_zero(m) / 8;
+                if (!cl.token(*p)) return;
+                ++p;
+            }
+        }
+        while (cl.token(*p)) ++p;
+    }
+
     token read_token() {
         unsigned char *s = p;
-        while (cl.token(*p)) ++p;
+        skip_token();
         token t{reinterpret_cast<char *>(s), static_cast<size_t>(p - s), cl.line_end(*p)};
         if (t.ends_line) note_end(p);
         *p = '\0';
@@ -174,10 +199,12 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
     t = lp.read_token();
     if (type == SEC_ACLE_TYPE_GROUP) {
         acle->id = t.s;
+        lp.idlen = t.len;
     } else {
+        lp.mechlen = t.len;
         if (t.len > MECH_MAX) return {ACL_RC_BAD_ACL, acl::msg::LINE_MECH_TOO_LONG.num, t.s};
         for (size_t i = 0; i < t.len; ++i) {
-            t.s[i] = static_cast<char>(zo_tolower_posix_1(static_cast<unsigned char>(t.s[i])));
+            t.s[i] = static_cast<char>(zo::fold(static_cast<unsigned char>(t.s[i])));
             acle->mech[i] = t.s[i];
         }
     }
@@ -187,14 +214,17 @@ fault parse_entry(line_parser &lp, const sec_perm_set_desc *permset, sec_acle_t 
 
     t = lp.read_token();
     acle->id = t.s;
+    lp.idlen = t.len;
     if (t.ends_line || lp.at_end_mark()) return {};
     return permissions(lp, permset, acle);
 }
 
 }  // namespace
 
+const unsigned char *acl__line_classes() { return t_classes.current(); }
+
 int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
-                                sec_acle_t acle, acl__line_fault *out) {
+                                sec_acle_t acle, acl__line_fault *out, acl__line_ctx *ctx) {
     std::memset(acle, 0, sizeof *acle);
     char *const start = *tacl;
     const size_t remaining = *length;
@@ -214,8 +244,14 @@ int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, s
         if (remaining == 1) return 0;
         if (!permset) permset = &acl__default_perm_set;
 
-        line_parser lp{classifier{}, reinterpret_cast<unsigned char *>(start)};
+        line_parser lp{classifier{ctx && ctx->classes ? ctx->classes : acl__line_classes()},
+                       reinterpret_cast<unsigned char *>(start),
+                       reinterpret_cast<const unsigned char *>(start) + remaining};
         f = parse_entry(lp, permset, acle);
+        if (ctx) {
+            ctx->mechlen = lp.mechlen;
+            ctx->idlen = lp.idlen;
+        }
         lp.find_end();
 
         consumed = static_cast<size_t>(lp.end - reinterpret_cast<unsigned char *>(start)) + 1;

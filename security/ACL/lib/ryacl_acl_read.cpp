@@ -71,7 +71,7 @@ struct reader {
     char *aclfbuf = nullptr;
     size_t aclfsize = 0;
     acl__textfile_opts opts{ACL_RC_FILE_ERROR, acl::msg::BAD_FILE.num, acl::msg::FILE_NOT_OWNED.num, acl::msg::FILE_OPEN.num, true, false,
-                            tr::level(tr::INFO) > 7, permtmpl};
+                            tr::level(tr::INFO) > 7, permtmpl, true};  // parse() frees the trees first
 
     reader(const char *fn, const char *un, const sec_perm_set_desc *pt, sec_buffer_t a, uint32_t f)
         : filename(fn), username(un), permtmpl(pt), acl(a), flags(f) {}

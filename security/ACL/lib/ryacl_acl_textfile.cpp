@@ -84,23 +84,27 @@ namespace {
 // batch ended (1: full, 0: end of text, else a faulty line's code, its
 // report kept in `fault`).
 struct line_batch {
-    static constexpr size_t kSize = 16;
+    static constexpr size_t kSize = 32;
     sec_acle_desc acles[kSize];
     acl__entry_parts parts[kSize];
     int32_t lines[kSize];
     size_t n = 0;
-    bool parted = false;  // parts filled
     int32_t end = 1;
     int32_t next_line = 1;  // the line after the batch
     acl__line_fault fault;
 
-    void fill(const acl__textfile_opts &o, char **cursor, size_t *left, int32_t *lineno) {
+    void fill(const acl__textfile_opts &o, const unsigned char *classes, const char *borrow, char **cursor,
+              size_t *left, int32_t *lineno) {
         n = 0;
         end = 1;
+        acl__line_ctx ctx;
+        ctx.classes = classes;
         while (n < kSize) {
-            end = acl__read_acle_deferred(o.permset, cursor, left, lineno, &acles[n], &fault);
+            end = acl__read_acle_deferred(o.permset, cursor, left, lineno, &acles[n], &fault, &ctx);
             if (end != 1) break;
             if (acles[n].type == 0) continue;  // blank or comment line
+            acl__entry_parts_known(acles[n], ctx.mechlen, ctx.idlen, &parts[n]);
+            parts[n].text = borrow;
             lines[n++] = *lineno - 1;          // the parser has counted the line it consumed
         }
         next_line = *lineno;
@@ -124,22 +128,29 @@ int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o,
     res->lineno = 1;
     if (!text) return 0;
     int32_t lineno = 1;
+    // The sink may print, but never changes this thread's locale.
+    const unsigned char *const classes = acl__line_classes();
+    // Identifiers stay in the text where the caller keeps it and the trees
+    // borrow from no other (offsets into it are 32 bits).
+    const char *borrow = nullptr;
+    if (o.trees_borrow_text && trees && size < UINT32_MAX && (!trees->text || trees->text == text) &&
+        (trees->text || trees->nooftrees == 0))
+        borrow = trees->text = text;
     line_batch b[2];
     line_batch *cur = &b[0], *ahead = &b[1];
-    cur->fill(o, &cursor, &left, &lineno);
-    cur->parted = acl__trees_prefetch(trees, cur->acles, cur->n, cur->parts);
+    cur->fill(o, classes, borrow, &cursor, &left, &lineno);
+    acl__trees_prefetch(trees, cur->parts, cur->n);
     for (;;) {
         ahead->n = 0;
         if (cur->end == 1) {
-            ahead->fill(o, &cursor, &left, &lineno);
-            ahead->parted = acl__trees_prefetch(trees, ahead->acles, ahead->n, ahead->parts);
+            ahead->fill(o, classes, borrow, &cursor, &left, &lineno);
+            acl__trees_prefetch(trees, ahead->parts, ahead->n);
         }
         for (size_t k = 0; k < cur->n; ++k) {
             const sec_acle_desc &acle = cur->acles[k];
             res->lineno = cur->lines[k] + 1;
             if (o.each_entry) sink.entry(acle, cur->lines[k]);
-            const int32_t add = cur->parted ? acl__add_parts_to_trees(cur->parts[k], trees)
-                                            : sec__add_acle_to_trees(&acle, trees);
+            const int32_t add = acl__add_parts_to_trees(cur->parts[k], trees);
             if (add == 0) {
                 ++res->entries;
                 continue;
@@ -161,8 +172,8 @@ int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o,
             // memory, that is no fault of the file and ends the parse anyway.
             if (!o.keep_going || rc == ACL_RC_NO_MEMORY) return rc;
             res->clean = false;
-            cur->fill(o, &cursor, &left, &lineno);
-            cur->parted = acl__trees_prefetch(trees, cur->acles, cur->n, cur->parts);
+            cur->fill(o, classes, borrow, &cursor, &left, &lineno);
+            acl__trees_prefetch(trees, cur->parts, cur->n);
             continue;
         }
         std::swap(cur, ahead);

@@ -23,6 +23,7 @@
 // one-entry trees, and several blocks each would blow the memory budget.
 #include "ryacl_acl_tree.h"
 
+#include <bit>
 #include <cstddef>
 #include <cstdlib>
 #include <cstring>
@@ -57,6 +58,13 @@ struct sec_acltree_s {
         uint32_t sorted_upto;  // entries [0, sorted_upto) ascend strictly
         uint32_t first_live;   // no present entry before it; only moves forward
         bool descending;       // every entry so far descends strictly
+        uint64_t last_key;     // order_key of the latest entry's identifier
+        // The arena is the text the entries were parsed from, which the
+        // tree does not own (arena_len and arena_cap are then 0): a
+        // million identifiers are not copied and their pages not touched
+        // again.  An entry from anywhere else ends it (unborrow).
+        bool borrowed;
+        bool ents_pooled;  // ents is a block of the trees' pool
     };
 
     // Null while the tree holds only the entry it was created with; then
@@ -66,6 +74,11 @@ struct sec_acltree_s {
     ent e0;  // that entry, while big is null
     unsigned char type;
     unsigned char mechlen;  // length of mech0
+    // e0's identifier came from a text the trees borrow from, at e0_text_off
+    // (its inline copy serves until the tree grows).
+    bool e0_in_text;
+    bool pooled;  // this block is the trees' pool's
+    uint32_t e0_text_off;
     // Followed in the same block by the big_part (once there is one), then
     // mech0 (the first entry's mechanism spelling, "" for types without
     // one) and its NUL, then, while big is null, the first entry's
@@ -298,49 +311,151 @@ bool grow_index(big_part *b, size_t need, size_t *failed) {
 // block.
 void free_big(big_part *b) {
     if (!b) return;
-    std::free(b->ents);
-    std::free(b->arena);
+    if (!b->ents_pooled) std::free(b->ents);
+    if (!b->borrowed) std::free(b->arena);
     std::free(b->idx);
 }
 
+// The first eight folded bytes of an identifier as a number that orders as
+// the text does, or 0 when they cannot decide alone (an empty identifier, or
+// a NUL among them, where the comparison of texts stops).  Comparing with
+// the latest entry is then mostly done without reading its identifier,
+// which a parsed text keeps far from anything else in cache.
+uint64_t order_key(const char *id, size_t len) {
+    if (len >= 8 && std::endian::native == std::endian::little) {
+        const uint64_t v = zo::load8(id);
+        if ((v - 0x0101010101010101ull) & ~v & 0x8080808080808080ull) return 0;  // a zero byte
+        return __builtin_bswap64(zo::fold8(v));
+    }
+    unsigned char b[8] = {};
+    std::memcpy(b, id, len < 8 ? len : 8);
+    uint64_t k = 0;
+    for (size_t j = 0; j < 8; ++j) {
+        if (j < len && b[j] == 0) return 0;
+        k = (k << 8) | zo::fold(b[j]);
+    }
+    return k;
+}
+
+// A block for a tree: from the pool when there is one and the block is
+// small, else from the heap.
+void *tree_block(acl__pool *pool, size_t n, bool *pooled, size_t align = 16) {
+    *pooled = pool && n <= acl__pool_max_block;
+    return *pooled ? acl__pool_alloc(pool, n, align) : acl__malloc(n);
+}
+
+// Grow the entry array to hold `need`, doubling.  A pooled array moves to a
+// new block (the pool releases the old one with the rest), to the heap once
+// it is too large to pool or no pool is given.
+bool grow_ents(big_part *b, size_t need, acl__pool *pool, size_t *failed) {
+    if (need <= b->cap) return true;
+    if (!b->ents_pooled) return acl__grow(&b->ents, &b->cap, need, failed);
+    size_t nc = b->cap ? b->cap : 4;
+    while (nc < need) nc *= 2;
+    ent *ne = nullptr;
+    uint32_t cap = 0;
+    bool pooled = false;
+    if (nc * sizeof(ent) <= acl__pool_max_block && pool) {
+        ne = static_cast<ent *>(tree_block(pool, nc * sizeof(ent), &pooled));
+        cap = static_cast<uint32_t>(nc);
+        if (!ne) *failed = nc * sizeof(ent);
+    } else if (!acl__grow(&ne, &cap, need, failed)) {
+        ne = nullptr;
+    }
+    if (!ne) return false;
+    if (b->n) std::memcpy(static_cast<void *>(ne), b->ents, size_t{b->n} * sizeof(ent));
+    b->ents = ne;
+    b->cap = cap;
+    b->ents_pooled = pooled;
+    return true;
+}
+
 // Move a one-entry tree to the growable form, with room for `more` further
-// entries and `bytes` further arena bytes.  The block is reallocated, so
-// the link to the tree is updated.
-int32_t promote(tree **node, size_t more, size_t bytes) {
+// entries and `bytes` further arena bytes; one whose entry came from `text`
+// borrows that text as its arena.  The block is reallocated, so the link to
+// the tree is updated.
+int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullptr, acl__pool *pool = nullptr) {
     static_assert(sizeof(tree) % alignof(big_part) == 0, "big_part follows the header");
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
     const size_t inl = t->e0.id_off + size_t{t->e0.id_len} + 1;
     const size_t keep = t->mechlen + 1u;
+    const uint64_t key0 = order_key(inline_bytes(t) + t->e0.id_off, t->e0.id_len);
     size_t failed = 0;
     big_part nb{};
     // A tree that grows past one entry usually grows further: start with
     // room for several, so a small tree is not reallocated at every step.
-    bool ok = acl__grow(&nb.ents, &nb.cap, more >= UINT32_MAX ? UINT32_MAX : (more < 7 ? 8 : 1 + more), &failed);
+    nb.ents_pooled = pool != nullptr;
+    bool ok = grow_ents(&nb, more >= UINT32_MAX ? UINT32_MAX : (more < 7 ? 8 : 1 + more), pool, &failed);
     size_t want = inl + bytes < 256 ? 256 : inl + bytes;
-    if (ok) ok = acl__grow(&nb.arena, &nb.arena_cap,
-                            want > UINT32_MAX ? UINT32_MAX : want, &failed);
+    nb.borrowed = text && t->e0_in_text;
+    if (ok && !nb.borrowed) ok = acl__grow(&nb.arena, &nb.arena_cap,
+                                          want > UINT32_MAX ? UINT32_MAX : want, &failed);
     tree *nt = nullptr;
     if (ok) {
-        std::memcpy(nb.arena, inline_bytes(t), inl);
-        nt = static_cast<tree *>(acl__realloc(t, sizeof(tree) + sizeof(big_part) + keep));
+        if (nb.borrowed) nb.arena = const_cast<char *>(text);  // never written through
+        else std::memcpy(nb.arena, inline_bytes(t), inl);
+        bool pooled = false;
+        // On a line of its own: what finding and growing the tree reads
+        // is then two lines, fetched ahead.
+        nt = static_cast<tree *>(tree_block(pool, sizeof(tree) + sizeof(big_part) + keep, &pooled, 64));
         if (!nt) failed = sizeof(tree) + sizeof(big_part) + keep;
+        if (nt) {
+            // The header, then mech0 behind the big_part.
+            std::memcpy(static_cast<void *>(nt), t, sizeof(tree));
+            std::memcpy(reinterpret_cast<char *>(nt) + sizeof(tree) + sizeof(big_part), inline_bytes(t), keep);
+            nt->pooled = pooled;
+            if (!t->pooled) std::free(t);
+        }
     }
     if (!nt) {
         free_big(&nb);
         return no_memory(fname, failed);
     }
     char *base = reinterpret_cast<char *>(nt) + sizeof(tree);
-    std::memmove(base + sizeof(big_part), base, keep);  // mech0 moves behind the big_part
-    nb.arena_len = static_cast<uint32_t>(inl);
+    nb.arena_len = nb.borrowed ? 0 : static_cast<uint32_t>(inl);
     nb.ents[0] = nt->e0;
+    if (nb.borrowed) nb.ents[0].id_off = nt->e0_text_off;
     nb.n = 1;
     nb.n_present = (nt->e0.flags & kPresent) ? 1 : 0;
     nb.sorted_upto = 1;
     nb.descending = true;
+    nb.last_key = key0;
     nt->big = reinterpret_cast<big_part *>(base);
     std::memcpy(static_cast<void *>(nt->big), &nb, sizeof nb);
     *node = nt;
+    return 0;
+}
+
+// The sign of the latest entry's identifier against id.
+int against_latest(const big_part *b, const char *id, size_t idlen) {
+    const uint64_t k = order_key(id, idlen);
+    if (k && b->last_key && k != b->last_key) return b->last_key < k ? -1 : 1;
+    const ent &e = b->ents[b->n - 1];
+    return zo::casecmp_len(b->arena + e.id_off, e.id_len, id, idlen);
+}
+
+// Give a tree that borrows its identifiers an arena of its own, for an
+// entry that does not come from the borrowed text.
+int32_t unborrow(big_part *b) {
+    size_t bytes = 0;
+    for (uint32_t i = 0; i < b->n; ++i) bytes += size_t{b->ents[i].id_len} + 1;
+    if (bytes > UINT32_MAX) return no_memory("sec__add_acle_to_tree", SIZE_MAX);
+    uint32_t cap = 0;
+    char *arena = nullptr;
+    size_t failed = 0;
+    if (!acl__grow(&arena, &cap, bytes, &failed)) return no_memory("sec__add_acle_to_tree", failed);
+    uint32_t at = 0;
+    for (uint32_t i = 0; i < b->n; ++i) {
+        ent &e = b->ents[i];
+        std::memcpy(arena + at, b->arena + e.id_off, size_t{e.id_len} + 1);
+        e.id_off = at;
+        at += e.id_len + 1;
+    }
+    b->arena = arena;
+    b->arena_len = at;
+    b->arena_cap = cap;
+    b->borrowed = false;
     return 0;
 }
 
@@ -385,17 +500,21 @@ int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
 }
 
 // Create a one-entry tree.
-int32_t create(const new_entry &ne, tree **node) {
+int32_t create(const new_entry &ne, tree **node, acl__pool *pool) {
     const size_t mechlen = has_mech(ne.type) ? ne.mechlen : 0;
     size_t size = sizeof(tree) + mechlen + 1;
     if (ne.idlen > UINT32_MAX - mechlen - 2 || size + ne.idlen + 1 < size)
         return no_memory("sec__add_acle_to_tree", SIZE_MAX);
     size += ne.idlen + 1;
-    auto *t = static_cast<tree *>(acl__malloc(size));
+    bool pooled = false;
+    auto *t = static_cast<tree *>(tree_block(pool, size, &pooled));
     if (!t) return no_memory("sec__add_acle_to_tree", size);
+    t->pooled = pooled;
     t->big = nullptr;
     t->type = ne.type;
     t->mechlen = static_cast<unsigned char>(mechlen);
+    t->e0_in_text = ne.text != nullptr;
+    t->e0_text_off = ne.text ? static_cast<uint32_t>(ne.id - ne.text) : 0;
     char *p = inline_bytes(t);
     std::memcpy(p, ne.mech, mechlen);
     p[mechlen] = '\0';
@@ -444,18 +563,28 @@ bool small_matches(const tree *t, const new_entry &ne) {
     return t->e0.id_len == ne.idlen && fold_eq(inline_bytes(t) + t->e0.id_off, ne.id, ne.idlen);
 }
 
-int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
+// Whether the mechanism is spelt as the tree's first entry spells it (the
+// two are known to be equal but for case).  A few bytes: no call.
+bool same_spelling(const tree *t, const char *mech) {
+    const char *m0 = inline_bytes(t);
+    for (unsigned k = 0; k < t->mechlen; ++k)
+        if (m0[k] != mech[k]) return false;
+    return true;
+}
+
+// `held`: the caller has checked that the tree is the entry's sub-ACL's.
+// `pool`: the trees' pool, for the tree's small blocks (null: the heap).
+int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held = false, acl__pool *pool = nullptr) {
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
-    if (!t) return create(ne, node);
-    if (t->type != ne.type || (has_mech(t->type) && (ne.mechlen != t->mechlen ||
-                                                     !fold_eq(inline_bytes(t), ne.mech, ne.mechlen))))
+    if (!t) return create(ne, node, pool);
+    if (!held && !acl__tree_holds(t, ne.type, ne.mech, ne.mechlen))
         return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, fname, 2, ne.type);
 
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
             return duplicate(single, ne, t->e0);
-        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1)) return rc;
+        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1, ne.text, pool)) return rc;
         t = *node;
     }
     big_part *b = t->big;
@@ -470,7 +599,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     } else {
         // Once neither direction holds the comparison tells nothing more.
         if (b->sorted_upto == i || b->descending)
-            last_cmp = zo::casecmp_len(b->arena + b->ents[i - 1].id_off, b->ents[i - 1].id_len, ne.id, ne.idlen);
+            last_cmp = against_latest(b, ne.id, ne.idlen);
         const bool in_run = (last_cmp < 0 && b->sorted_upto == i) || (last_cmp > 0 && b->descending);
         if (!b->idx && !in_run) {
             if (i > kScanMax) {
@@ -487,11 +616,14 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     }
 
     // A new entry: make room everywhere before changing anything.
-    const bool own = has_mech(t->type) && std::memcmp(ne.mech, inline_bytes(t), t->mechlen) != 0;
-    const size_t add = (own ? t->mechlen + 1 : 0) + ne.idlen + 1;
+    const bool own = has_mech(t->type) && !same_spelling(t, ne.mech);
+    const bool borrow = b->borrowed && ne.text == b->arena && !own;
+    if (b->borrowed && !borrow)
+        if (int32_t rc = unborrow(b)) return rc;
+    const size_t add = borrow ? 0 : (own ? t->mechlen + 1 : 0) + ne.idlen + 1;
     if (i == UINT32_MAX || add > UINT32_MAX - size_t{b->arena_len}) return no_memory(fname, SIZE_MAX);
-    if (!acl__grow(&b->ents, &b->cap, size_t{i} + 1, &failed) ||
-        !acl__grow(&b->arena, &b->arena_cap, size_t{b->arena_len} + add, &failed))
+    if (!grow_ents(b, size_t{i} + 1, pool, &failed) ||
+        (!borrow && !acl__grow(&b->arena, &b->arena_cap, size_t{b->arena_len} + add, &failed)))
         return no_memory(fname, failed);
     if (b->idx && !found) {
         uint64_t *old = b->idx;
@@ -499,14 +631,18 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
         if (b->idx != old) slot = probe(b, ne, &found);
     }
 
-    char *p = b->arena + b->arena_len;
-    if (own) {
-        std::memcpy(p, ne.mech, t->mechlen);
-        p[t->mechlen] = '\0';
-        p += t->mechlen + 1;
+    const char *p = ne.id;  // where the stored identifier is
+    if (!borrow) {
+        char *q = b->arena + b->arena_len;
+        if (own) {
+            std::memcpy(q, ne.mech, t->mechlen);
+            q[t->mechlen] = '\0';
+            q += t->mechlen + 1;
+        }
+        std::memcpy(q, ne.id, ne.idlen);
+        q[ne.idlen] = '\0';
+        p = q;
     }
-    std::memcpy(p, ne.id, ne.idlen);
-    p[ne.idlen] = '\0';
     b->ents[i] = ent{static_cast<uint32_t>(p - b->arena), static_cast<uint32_t>(ne.idlen), ne.perm,
                      ne.h() | kPresent | (own ? kOwnMech : 0)};
     b->arena_len += static_cast<uint32_t>(add);
@@ -517,6 +653,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node) {
     if (has_id(t->type)) {
         if (b->sorted_upto == i && last_cmp < 0) b->sorted_upto = i + 1;
         b->descending = b->descending && last_cmp > 0;
+        if (b->sorted_upto == i + 1 || b->descending) b->last_key = order_key(ne.id, ne.idlen);
     }
     b->n = i + 1;
     ++b->n_present;
@@ -551,8 +688,23 @@ bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts) {
     return acl__valid_type(acle->type);
 }
 
+void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts) {
+    *parts = acl__entry_parts{};
+    parts->type = acle.type;
+    parts->perm = acle.perm;
+    parts->mech = has_mech(acle.type) ? acle.mech : "";
+    parts->mechlen = has_mech(acle.type) ? mechlen : 0;
+    parts->id = has_id(acle.type) && acle.id ? acle.id : "";
+    parts->idlen = has_id(acle.type) && acle.id ? idlen : 0;
+}
+
 int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts) {
     return insert(single, new_entry(parts), node);
+}
+
+int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
+                              acl__pool *pool) {
+    return insert(single, new_entry(parts), node, true, pool);
 }
 
 bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mech, size_t mechlen) {
@@ -569,7 +721,10 @@ void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
     if (!t || !t->big) return;  // a one-entry tree is its own block
     const big_part *b = t->big;
     if (b->idx) {
-        __builtin_prefetch(&b->idx[slot_of(idhash, b->idx_mask)]);
+        // The probe runs on from the home slot, often into the next line.
+        const size_t home = slot_of(idhash, b->idx_mask);
+        __builtin_prefetch(&b->idx[home]);
+        __builtin_prefetch(&b->idx[(home + 8) & b->idx_mask]);
     } else if (b->n <= kScanMax) {
         // A small tree scans its entries.
         const char *e = reinterpret_cast<const char *>(b->ents);
@@ -579,7 +734,7 @@ void acl__tree_prefetch(const sec_acltree_s *t, uint32_t idhash) {
         __builtin_prefetch(&b->ents[b->n - 1]);
     }
     __builtin_prefetch(b->ents + b->n, 1);
-    __builtin_prefetch(b->arena + b->arena_len, 1);
+    if (!b->borrowed) __builtin_prefetch(b->arena + b->arena_len, 1);
 }
 
 uint32_t acl__tree_key_hash(const sec_acltree_s *t) {
@@ -603,11 +758,13 @@ int32_t acl__tree_reserve(sec_acltree_t *node, size_t entries, size_t bytes) {
     if (!t) return 0;
     if (!t->big) return promote(node, entries, bytes);
     big_part *b = t->big;
+    if (b->borrowed)
+        if (int32_t rc = unborrow(b)) return rc;
     size_t failed = 0;
     size_t ne = size_t{b->n} + entries, nb = size_t{b->arena_len} + bytes;
     if (ne > UINT32_MAX) ne = UINT32_MAX;
     if (nb > UINT32_MAX) nb = UINT32_MAX;
-    if (!acl__grow(&b->ents, &b->cap, ne, &failed) ||
+    if (!grow_ents(b, ne, nullptr, &failed) ||
         !acl__grow(&b->arena, &b->arena_cap, nb, &failed) ||
         (b->idx && !grow_index(b, size_t{b->idx_used} + entries, &failed)))
         return no_memory("sec__add_acle_to_tree", failed);
@@ -660,7 +817,7 @@ int32_t sec__del_acle_from_tree(const sec_acle_desc *acle, sec_acltree_t t) {
 void sec__free_acltree(sec_acltree_t t) {
     if (!t) return;
     free_big(t->big);
-    std::free(t);
+    if (!t->pooled) std::free(t);
 }
 
 int32_t sec__acltree_to_aclelist(sec_acltree_t t, sec_acle_list_t list) {

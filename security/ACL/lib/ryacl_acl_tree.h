@@ -24,6 +24,7 @@
 
 struct sec_acltree_s;
 struct acl__entry_parts;
+struct acl__pool;
 typedef sec_acltree_s *sec_acltree_t;
 
 // The growable array of trees of an ACL under construction, one slot per
@@ -33,18 +34,18 @@ struct acl__trees_s {
     sec_acltree_t *trees = nullptr;
     int32_t nooftrees = 0;
     void *index = nullptr;  // owned; see ryacl_acl_tree.cpp
+    // The one text the trees' identifiers may point into (see
+    // acl__parse_acltext); it must outlive them.
+    const char *text = nullptr;
 };
 
 // Find or append the tree of the entry's sub-ACL and insert a copy of the
 // entry, refusing a duplicate (43 with message 160, 144 or 161).
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees);
-// Entries about to be added, in the order they will be: taken apart into
-// parts[0, n) and hashed, and what adding each will touch fetched into
-// cache, so that the misses of a batch overlap instead of coming one after
-// another.  Changes no tree.  False when an entry's type is none of the
-// five (parts from it on are not filled).
-bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
-                         acl__entry_parts *parts);
+// Entries about to be added, as parts, in the order they will be: hashed,
+// and what adding each will touch fetched into cache, so that the misses of
+// a batch overlap instead of coming one after another.  Changes no tree.
+void acl__trees_prefetch(const acl__trees_s *trees, acl__entry_parts *parts, size_t n);
 // sec__add_acle_to_trees of an entry as parts (its hash kept).
 int32_t acl__add_parts_to_trees(const acl__entry_parts &parts, acl__trees_s *trees);
 // Release every tree (the last first) and the array; leaves it empty.
@@ -115,6 +116,12 @@ struct acl__entry_parts {
     // The slot of its tree in the array of trees, once found (a slot keeps
     // its tree for good).
     int32_t tree_slot = -1;
+    // The hash of its sub-ACL's key (acl__subacl_key_hash), once taken.
+    uint32_t keyhash = 0;
+    bool keyhashed = false;
+    // A text that holds id NUL-terminated, less than 4 GiB from its start,
+    // and outlives the tree: the tree may keep id where it is.
+    const char *text = nullptr;
 };
 // The hash the trees index an identifier by.
 uint32_t acl__id_hash(const char *id, size_t idlen);
@@ -123,8 +130,15 @@ uint32_t acl__id_hash(const char *id, size_t idlen);
 void acl__tree_prefetch(const sec_acltree_s *tree, uint32_t idhash);
 // The parts of an entry record; false for a type that is none of the five.
 bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts);
+// The same for a record the parser made, whose lengths it gave.
+void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts);
 // acl__tree_insert with the entry as parts.
 int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts);
+// The same for a tree that acl__tree_holds has just said is the entry's
+// (or null: a new one), its small blocks taken from `pool` (null: the
+// heap).  A tree with pooled blocks must be freed before the pool.
+int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
+                              acl__pool *pool);
 // Whether the tree is that of sub-ACL (type, mechanism): the key it was
 // created with, the mechanism compared case-insensitively.
 bool acl__tree_holds(const sec_acltree_s *tree, unsigned char type, const char *mech, size_t mechlen);

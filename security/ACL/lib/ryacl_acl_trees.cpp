@@ -27,6 +27,7 @@ struct trees_index {
     size_t cap;   // capacity of the trees array
     int32_t last; // slot of the previous insertion, checked first
     uint32_t last_hash;  // its key's hash
+    acl__pool pool;      // the trees' small blocks
 };
 
 void index_put(trees_index *x, uint64_t v) {
@@ -74,8 +75,7 @@ int32_t candidate(const trees_index *x, uint32_t h) {
 }
 
 // The slot of the tree of (type, mech), or -1; changes nothing.
-int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__entry_parts &ne) {
-    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
+int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__entry_parts &ne, uint32_t h) {
     if (x->last >= 0 && x->last < trees->nooftrees && h == x->last_hash &&
         acl__tree_holds(trees->trees[x->last], ne.type, ne.mech, ne.mechlen))
         return x->last;
@@ -90,20 +90,18 @@ int32_t find_tree(const acl__trees_s *trees, const trees_index *x, const acl__en
 
 }  // namespace
 
-bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, size_t n,
-                         acl__entry_parts *parts) {
+void acl__trees_prefetch(const acl__trees_s *trees, acl__entry_parts *parts, size_t n) {
     constexpr size_t kMax = 64;
     uint32_t keys[kMax];
     if (n > kMax) n = kMax;
     for (size_t k = 0; k < n; ++k) {
-        if (!acl__entry_parts_of(&acles[k], &parts[k])) return false;
         if (acl__type_has_id(parts[k].type)) {
             parts[k].idhash = acl__id_hash(parts[k].id, parts[k].idlen);
             parts[k].hashed = true;
         }
     }
     const auto *x = trees ? static_cast<const trees_index *>(trees->index) : nullptr;
-    if (!x || !x->slots) return true;
+    if (!x || !x->slots) return;
     // Each step reads what the step before fetched, for the whole batch at
     // once, so that the batch's misses overlap at every step: the index
     // slot of the entry's sub-ACL, the array slot, the tree's block, what
@@ -111,6 +109,8 @@ bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, 
     // when the entry is added (two keys may share a hash).
     for (size_t k = 0; k < n; ++k) {
         keys[k] = acl__subacl_key_hash(parts[k].type, parts[k].mech, parts[k].mechlen);
+        parts[k].keyhash = keys[k];
+        parts[k].keyhashed = true;
         __builtin_prefetch(&x->slots[slot_of(keys[k], x->mask)]);
     }
     for (size_t k = 0; k < n; ++k) {
@@ -127,7 +127,6 @@ bool acl__trees_prefetch(const acl__trees_s *trees, const sec_acle_desc *acles, 
         }
     for (size_t k = 0; k < n; ++k)
         if (parts[k].tree_slot >= 0) acl__tree_prefetch(trees->trees[parts[k].tree_slot], parts[k].idhash);
-    return true;
 }
 
 int32_t sec__add_acle_to_trees(const sec_acle_desc *acle, acl__trees_s *trees) {
@@ -154,15 +153,15 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     // handed in already filled).
     if (!x->slots && trees->nooftrees > 0)
         if (int32_t rc = index_room(x, trees, 0)) return rc;
+    const uint32_t h = ne.keyhashed ? ne.keyhash : acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
     const int32_t found = ne.tree_slot >= 0 && ne.tree_slot < trees->nooftrees &&
                                   acl__tree_holds(trees->trees[ne.tree_slot], ne.type, ne.mech, ne.mechlen)
                               ? ne.tree_slot
-                              : find_tree(trees, x, ne);
-    const uint32_t h = acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
+                              : find_tree(trees, x, ne, h);
     if (found >= 0) {
         x->last = found;
         x->last_hash = h;
-        return acl__tree_insert_parts(&trees->trees[found], 1, ne);
+        return acl__tree_insert_held(&trees->trees[found], 1, ne, &x->pool);
     }
 
     // A new sub-ACL: grow the index and the array first, so a failure
@@ -182,7 +181,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     trees->trees[slot] = nullptr;
     // When the first entry cannot be stored the slot stays, counted and
     // empty, and out of the index.
-    int32_t rc = acl__tree_insert_parts(&trees->trees[slot], 1, ne);
+    int32_t rc = acl__tree_insert_held(&trees->trees[slot], 1, ne, &x->pool);
     if (rc) return rc;
     index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
     ++x->used;
@@ -199,10 +198,12 @@ void acl__free_trees(acl__trees_s *trees) {
     }
     std::free(trees->trees);
     if (auto *x = static_cast<trees_index *>(trees->index)) {
+        acl__pool_release(&x->pool);  // after the trees whose blocks it holds
         std::free(x->slots);
         std::free(x);
     }
     trees->trees = nullptr;
     trees->index = nullptr;
+    trees->text = nullptr;
 }
 

@@ -77,3 +77,36 @@ void acl__advise_large(void *p, size_t n) {
     (void)n;
 #endif
 }
+
+void *acl__pool_alloc(acl__pool *pool, size_t n, size_t align) {
+    n = (n + 15) & ~size_t{15};
+    const auto skip = [&] { return (align - reinterpret_cast<uintptr_t>(pool->at) % align) % align; };
+    if (!pool->at || static_cast<size_t>(pool->end - pool->at) < n + skip()) {
+        // Chunks double from 64 KiB to 4 MiB: a small ACL stays small, a
+        // large one makes few chunks, advised into huge pages.
+        constexpr size_t kFirst = size_t{64} << 10, kLast = size_t{4} << 20, kHead = 16;
+        const size_t size = pool->next_size ? pool->next_size : kFirst;
+        char *c = static_cast<char *>(acl__malloc(size));
+        if (!c) return nullptr;
+        acl__advise_large(c, size);
+        std::memcpy(c, &pool->chunks, sizeof pool->chunks);
+        pool->chunks = c;
+        pool->at = c + kHead;
+        pool->end = c + size;
+        pool->next_size = size < kLast ? size * 2 : kLast;
+    }
+    pool->at += skip();
+    void *r = pool->at;
+    pool->at += n;
+    return r;
+}
+
+void acl__pool_release(acl__pool *pool) {
+    while (pool->chunks) {
+        void *prev;
+        std::memcpy(&prev, pool->chunks, sizeof prev);
+        std::free(pool->chunks);
+        pool->chunks = prev;
+    }
+    *pool = acl__pool{};
+}

@@ -108,6 +108,7 @@ void check_stdin(file_report &r) {
                          acl::msg::CHECK_FILE_OPEN.num};
     o.keep_going = true;
     o.permset = &acl__default_perm_set;
+    o.trees_borrow_text = true;  // the trees go before the text
     collect_sink sink(r);
     acl__trees_s trees;
     acl__parse_result res;

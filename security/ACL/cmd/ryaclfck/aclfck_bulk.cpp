@@ -21,6 +21,7 @@ acl__textfile_opts checker_opts(uint32_t flags) {
     o.keep_going = (flags & ACLFCK_CONTINUE) != 0;
     o.each_entry = (flags & ACLFCK_VERBOSE) != 0;
     o.permset = &acl__default_perm_set;
+    o.trees_borrow_text = true;  // aclfck__check frees the trees first
     return o;
 }
 
