@@ -419,7 +419,7 @@ inline void insert(const unsigned char *p, id_slot *t, uint32_t n, const pending
 // the entries end; 0 when a rule fails.
 size_t fill_entries(const unsigned char *p, size_t len, size_t pos, uint32_t count, id_slot *t, uint32_t n,
                     uint64_t seed, copier &c) {
-    constexpr uint32_t kAhead = 16;
+    constexpr uint32_t kAhead = 32;
     pending ring[kAhead];
     head16 top{};  // the highest identifier so far
     const char *topid = nullptr;
@@ -436,7 +436,9 @@ size_t fill_entries(const unsigned char *p, size_t len, size_t pos, uint32_t cou
         const bool reached = !topid || order(head, id, idl, top, topid, toplen) > 0;
         if (reached) top = {head.a, head.b}, topid = id, toplen = idl;
         const uint32_t slot = slot_of(h, n);
+        // The four slots from the home may end on the next line.
         __builtin_prefetch(t + slot, 1);
+        __builtin_prefetch(t + slot + kSpill, 1);
         pending &r = ring[k % kAhead];
         if (k >= kAhead) insert(p, t, n, r);
         r = {(static_cast<uint32_t>(h) & ~kReached) | (reached ? kReached : 0), static_cast<uint32_t>(pos), slot};
