@@ -184,10 +184,6 @@ namespace {
 
 constexpr const char *kCreate = "sec_create_acl_index";
 
-// Zero bytes after the copy: whole-word reads of its last identifier stay
-// inside the block.
-constexpr size_t kPad = 16;
-
 void release(sec_acl_index_s *ix) {
     if (!ix) return;
     std::free(ix->bytes);
@@ -475,7 +471,6 @@ bool build(sec_acl_index_s *ix, const unsigned char *p, size_t len) {
         pos = end;
     }
     c.upto(pos);
-    std::memset(ix->bytes + pos, 0, kPad);
     return true;
 }
 
@@ -513,11 +508,11 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     ix->slots = reinterpret_cast<id_slot *>(block + slots_at);
     ix->mech_mask = static_cast<uint32_t>(nmech - 1);
     ix->seed = process_seed();
-    if (!(ix->bytes = static_cast<unsigned char *>(acl__malloc(len + kPad)))) {
+    if (!(ix->bytes = static_cast<unsigned char *>(acl__malloc(len)))) {
         release(ix);
-        return acl__no_memory(kCreate, len + kPad);
+        return acl__no_memory(kCreate, len);
     }
-    acl__advise_large(ix->bytes, len + kPad);
+    acl__advise_large(ix->bytes, len);
     if (!build(ix, p, len)) {
         release(ix);
         return refuse(acl);
