@@ -95,6 +95,18 @@ TEST(IndexCreation, EveryAllocationFailureIsReportedAndLeavesNoIndex) {
     EXPECT_EQ(sites, 2);  // the tables' block and the copy
     sec_release_acl_index(ix);  // the run that reached no failure
     drop(d);
+    // Both blocks are taken before the entries are checked: an entry that
+    // breaks a rule is still refused as validation refuses it.
+    bytes bad = make_acl({subacl(16, "", {{2, "g"}})});
+    bad[15] = 2;  // the entry's version
+    d = own(bad);
+    for (long nth : {1, 2}) {
+        rytest::alloc_fail_nth(nth);
+        EXPECT_EQ(with_msg(sec_create_acl_index(&d, &ix)), rc_msg(ACL_RC_BAD_ACLE, 112)) << nth;
+        rytest::alloc_fail_none();
+        EXPECT_EQ(ix, nullptr) << nth;
+    }
+    drop(d);
 }
 
 // One query through the walk and through the index: code, full record, mask

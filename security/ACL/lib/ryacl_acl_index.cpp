@@ -221,10 +221,15 @@ inline size_t table_size(uint32_t n) { return size_t{n} + n / 2 + 1 + kSpill; }
 
 // The header of the sub-ACL at pos keeps validation's rules: it and its
 // length lie in the block, its type is known, its mechanism field is right
-// for the type and lies in the block, and its count fits in what follows
-// (each entry takes its header, and with an identifier at least a NUL).
-bool header_ok(const unsigned char *p, size_t len, size_t pos) {
-    if (!acl__fits(pos, ACL_SUBACL_HDR_SIZE, len) || acl__load_le32(p + pos) > len - pos) return false;
+// for the type and lies in the block, and its count fits in its room (each
+// entry takes its header, and with an identifier at least a NUL).  The
+// room of a sub-ACL but the last is its length, since the next must begin
+// where its entries end: the counts of all sub-ACLs together stay within
+// the block, and so does what is allocated for them.
+bool header_ok(const unsigned char *p, size_t len, size_t pos, bool last) {
+    if (!acl__fits(pos, ACL_SUBACL_HDR_SIZE, len)) return false;
+    const size_t length = acl__load_le32(p + pos);
+    if (length > len - pos) return false;
     const unsigned type = p[pos + 4], mlen = p[pos + 9];
     const uint32_t count = acl__load_le32(p + pos + 5);
     if (!acl__valid_type(type)) return false;
@@ -234,26 +239,24 @@ bool header_ok(const unsigned char *p, size_t len, size_t pos) {
     } else if (mlen != 0 || (!acl__type_has_id(type) && count > 1)) {
         return false;
     }
-    const size_t room = len - pos - ACL_SUBACL_HDR_SIZE - mlen;
-    return count <= room / (ACL_ENTRY_HDR_SIZE + (acl__type_has_id(type) ? 1u : 0u));
+    const size_t room = last ? len - pos : length;
+    if (room < ACL_SUBACL_HDR_SIZE + mlen) return false;
+    return count <= (room - ACL_SUBACL_HDR_SIZE - mlen) / (ACL_ENTRY_HDR_SIZE + (acl__type_has_id(type) ? 1u : 0u));
 }
 
-// Every sub-ACL header keeps its rules, each but the last steps past its
-// own header; *nslots: the slots the user and group sub-ACLs could need
-// (a later sub-ACL of a type and mechanism met before is counted and
-// never filled).
+// Every sub-ACL header keeps its rules; *nslots: the slots the user and
+// group sub-ACLs could need (a later sub-ACL of a type and mechanism met
+// before is counted and never filled).
 bool headers_ok(const unsigned char *p, size_t len, size_t *nslots) {
     const unsigned nsub = acl__load_le16(p + 3);
     size_t pos = ACL_HDR_SIZE;
     *nslots = 0;
     for (unsigned k = 0; k < nsub; ++k) {
-        if (!header_ok(p, len, pos)) return false;
+        if (!header_ok(p, len, pos, k + 1 == nsub)) return false;
         const unsigned type = p[pos + 4];
         if (type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP)
             *nslots += table_size(acl__load_le32(p + pos + 5));
-        const uint32_t length = acl__load_le32(p + pos);
-        if (k + 1 < nsub && length < ACL_SUBACL_HDR_SIZE) return false;
-        pos += length;
+        pos += acl__load_le32(p + pos);
     }
     return true;
 }
@@ -477,6 +480,14 @@ bool build(sec_acl_index_s *ix, const unsigned char *p, size_t len) {
 // The refusal of a buffer that broke a rule: validation's own record.
 int32_t refuse(sec_acl_buffer_t acl) { return sec_convert_acl_to_host(1, acl); }
 
+// A block of n bytes could not be had before the walk that checks the
+// entries: a buffer that breaks a rule is still refused as validation
+// refuses it, whatever memory there is.
+int32_t no_memory(sec_acl_buffer_t acl, size_t n) {
+    if (int32_t rc = refuse(acl)) return rc;
+    return acl__no_memory(kCreate, n);
+}
+
 int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     if (!acl) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, kCreate, 1, 0);
     if (!index) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, kCreate, 2, 0);
@@ -498,7 +509,7 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     static_assert(sizeof(sec_acl_index_s) % alignof(sub_info) == 0 && sizeof(sub_info) % alignof(mech_slot) == 0 &&
                   sizeof(mech_slot) % alignof(id_slot) == 0);
     auto *block = static_cast<unsigned char *>(acl__calloc(size, 1));
-    if (!block) return acl__no_memory(kCreate, size);
+    if (!block) return no_memory(acl, size);
     // Fresh pages would be much of the creation of a large index: fewer,
     // larger ones where the blocks allow.
     acl__advise_large(block + slots_at, nslots * sizeof(id_slot));
@@ -510,7 +521,7 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     ix->seed = process_seed();
     if (!(ix->bytes = static_cast<unsigned char *>(acl__malloc(len)))) {
         release(ix);
-        return acl__no_memory(kCreate, len);
+        return no_memory(acl, len);
     }
     acl__advise_large(ix->bytes, len);
     if (!build(ix, p, len)) {
