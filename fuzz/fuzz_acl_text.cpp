@@ -21,6 +21,7 @@
 #include "ryacl_acl_buffer.h"
 #include "ryacl_acl_dump.h"
 #include "ryacl_acl_entry.h"
+#include "ryacl_acl_file.h"
 #include "ryacl_acl_tree.h"
 
 namespace {
@@ -119,6 +120,27 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     FUZZ_CHECK(sec__acltrees_to_acl(&trees, &compiled) == 0);
     acl__free_trees(&trees);
     FUZZ_CHECK(same_bytes(compiled, expected));
+    // The checker's own road (lines parsed a batch ahead, identifiers left
+    // in the text) compiles the same bytes, from an exact-size copy.
+    {
+        std::vector<char> again;
+        again.reserve(orig.size());
+        again.assign(orig.begin(), orig.end());
+        acl__textfile_opts o{ACL_RC_FILE_ERROR, 0, 0, 0};
+        o.keep_going = true;
+        o.trees_borrow_text = true;
+        struct : acl__text_sink {
+            void fault(int32_t, int32_t) override {}
+        } sink;
+        acl__trees_s batched;
+        acl__parse_result res;
+        FUZZ_CHECK(acl__parse_acltext(again.data(), again.size() - 1, o, sink, &batched, &res) == 0);
+        sec_acl_buffer_desc second{0, nullptr};
+        FUZZ_CHECK(sec__acltrees_to_acl(&batched, &second) == 0);
+        acl__free_trees(&batched);
+        FUZZ_CHECK(same_bytes(second, expected));
+        std::free(second.value);
+    }
     FUZZ_CHECK(sec_convert_acl_to_host(1, &compiled) == 0);
 
     std::vector<listed> want;

@@ -272,3 +272,22 @@ TEST(AllocFailures, HandlerRegistration) {
 }
 
 }  // namespace
+
+// Many small sub-ACLs take their blocks from chunks of growing size, the
+// large ones huge-page aligned: when one of those cannot be had, the read
+// fails cleanly (and leaks nothing, as the sanitizer run checks).
+TEST(AllocFailures, LargeChunkOfManySmallSubacls) {
+    rytest::tmp_dir dir;
+    std::string text;
+    for (int m = 0; m < 30000; ++m)
+        for (const char *who : {"ann", "bob"}) text += "u m" + std::to_string(m) + " " + who + " r\n";
+    rytest::write_file(dir / "many.acl", text);
+    sec_buffer_desc acl{0, nullptr};
+    acl__set_alloc_hook([](size_t n) { return n < (size_t{2} << 20); });
+    const int32_t rc = sec_read_acl_file((dir / "many.acl").c_str(), nullptr, nullptr, SEC_ACLF_FROM_TEXT, &acl, nullptr);
+    acl__set_alloc_hook(nullptr);
+    expect_no_memory(rc, 0, "a 2 MiB chunk");
+    EXPECT_TRUE(acl.length == 0 && acl.value == nullptr);
+    EXPECT_EQ(sec_read_acl_file((dir / "many.acl").c_str(), nullptr, nullptr, SEC_ACLF_FROM_TEXT, &acl, nullptr), 0);
+    sec_release_acl(&acl);
+}

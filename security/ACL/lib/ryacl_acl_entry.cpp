@@ -19,7 +19,7 @@ namespace trace = acl::trace;
 
 extern "C" {
 
-const sec_perm_desc acl__default_perm_list[13] = {
+constexpr sec_perm_desc acl__default_perm_list[13] = {
     {0x00000001u, 'r', "read", "general purpose read operation"},
     {0x00000002u, 'w', "write", "general purpose write operation"},
     {0x00000004u, 'c', "control", "general purpose control operation"},
@@ -224,11 +224,15 @@ namespace {
 // changes, so the two cannot disagree.
 struct letter_table {
     uint32_t code[256] = {};
-    letter_table() {
+    constexpr letter_table() {
         for (int32_t i = 13; i-- > 0;)  // the first template of a letter wins
             code[static_cast<unsigned char>(acl__default_perm_list[i].printchar)] = acl__default_perm_list[i].code;
     }
 };
+
+// Built by the compiler: no call pays for a guard, and no order of static
+// initialisers can find it empty.
+constexpr letter_table g_letters;
 
 bool is_default_set(const sec_perm_set_desc *permset) {
     return permset == &acl__default_perm_set && permset->perms == acl__default_perm_list && permset->count == 13;
@@ -238,10 +242,9 @@ bool is_default_set(const sec_perm_set_desc *permset) {
 
 int32_t sec__translate_perms(const char *ps, const sec_perm_set_desc *permset, uint32_t *perm) {
     if (is_default_set(permset)) {
-        static const letter_table table;
         uint32_t bits = 0;
         for (const char *c = ps; *c; ++c) {
-            const uint32_t code = table.code[static_cast<unsigned char>(*c)];
+            const uint32_t code = g_letters.code[static_cast<unsigned char>(*c)];
             if (!code) {
                 *perm |= bits;
                 return acl::set_error(ACL_RC_PERMISSION, acl::msg::BAD_PERM_LETTER, static_cast<unsigned char>(*c));

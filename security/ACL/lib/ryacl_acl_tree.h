@@ -6,9 +6,11 @@
 // The names say "tree" because that is what every caller knows them as;
 // none of them is one.  A tree is an opaque object reached through
 // sec_acltree_t (null while empty): its entries in arrival order in one
-// array, their identifiers in one byte arena, and, once it grows past a
-// few entries in no order, a hash index on the folded identifier
-// (ryacl_acl_tree.cpp).  A search tree costs a comparison per level and,
+// array, their identifiers in one byte arena (or, for a tree built from a
+// parsed text that outlives it, left in that text), and, once it grows past
+// a few entries in no order, a hash index on the folded identifier
+// (ryacl_acl_tree.cpp).  The trees of an ACL under construction take their
+// small blocks from one pool, released with them.  A search tree costs a comparison per level and,
 // fed a sorted file, becomes a chain as deep as the file is long; the
 // hashed arena finds a duplicate in O(1) whatever the input order, never
 // recurses, and the order the writer needs is made once, when the entries

@@ -34,6 +34,12 @@ void *acl__calloc(size_t count, size_t size) {
     return std::calloc(count ? count : 1, size ? size : 1);
 }
 
+void *acl__malloc_aligned(size_t align, size_t n) {
+    if (!allowed(n)) return nullptr;
+    n = n ? (n + align - 1) / align * align : align;  // aligned_alloc wants a multiple
+    return std::aligned_alloc(align, n);
+}
+
 void *acl__realloc(void *p, size_t n) {
     if (!allowed(n)) return nullptr;
     return std::realloc(p, n ? n : 1);
@@ -68,7 +74,7 @@ void acl__advise_large(void *p, size_t n) {
     // Only whole 2 MiB stretches inside the block are advised; the advice
     // changes no content and a refusal is harmless.
     constexpr uintptr_t kHuge = uintptr_t{2} << 20;
-    if (!p || n < 2 * kHuge) return;
+    if (!p || n < kHuge) return;
     uintptr_t a = (reinterpret_cast<uintptr_t>(p) + kHuge - 1) & ~(kHuge - 1);
     uintptr_t e = (reinterpret_cast<uintptr_t>(p) + n) & ~(kHuge - 1);
     if (e > a) madvise(reinterpret_cast<void *>(a), e - a, MADV_HUGEPAGE);
@@ -84,9 +90,11 @@ void *acl__pool_alloc(acl__pool *pool, size_t n, size_t align) {
     if (!pool->at || static_cast<size_t>(pool->end - pool->at) < n + skip()) {
         // Chunks double from 64 KiB to 4 MiB: a small ACL stays small, a
         // large one makes few chunks, advised into huge pages.
-        constexpr size_t kFirst = size_t{64} << 10, kLast = size_t{4} << 20, kHead = 16;
+        constexpr size_t kFirst = size_t{64} << 10, kLast = size_t{4} << 20, kHead = 16, kHugeChunk = size_t{2} << 20;
         const size_t size = pool->next_size ? pool->next_size : kFirst;
-        char *c = static_cast<char *>(acl__malloc(size));
+        // A large chunk starts on a huge-page boundary, so that all of it
+        // can be backed by huge pages: the trees in it are reached at random.
+        char *c = static_cast<char *>(size >= kHugeChunk ? acl__malloc_aligned(kHugeChunk, size) : acl__malloc(size));
         if (!c) return nullptr;
         acl__advise_large(c, size);
         std::memcpy(c, &pool->chunks, sizeof pool->chunks);

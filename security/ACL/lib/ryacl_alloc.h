@@ -10,6 +10,8 @@
 void *acl__malloc(size_t n);
 void *acl__calloc(size_t count, size_t size);
 void *acl__realloc(void *p, size_t n);
+// n bytes aligned to `align` (a power of two), released with free.
+void *acl__malloc_aligned(size_t align, size_t n);
 char *acl__strdup(const char *s);
 char *acl__strndup(const char *s, size_t n);
 
