@@ -201,7 +201,8 @@ TEST(IndexEvaluation, LargeTablesAnswerAsTheWalk) {
     sec_buffer_desc d = own(b);
     for (int i = 0; i < kCount + 200; i += 173) {
         const std::string id = name(i, i % 2);
-        EXPECT_EQ(answer({4, "unix", nullptr, id.c_str()}, nullptr, ix), answer({4, "unix", nullptr, id.c_str()}, &d, nullptr)) << id;
+        EXPECT_EQ(answer({4, "unix", nullptr, id.c_str()}, nullptr, ix),
+                  answer({4, "unix", nullptr, id.c_str()}, &d, nullptr)) << id;
         EXPECT_EQ(answer({0, nullptr, nullptr, nullptr, {id.c_str()}}, nullptr, ix),
                   answer({0, nullptr, nullptr, nullptr, {id.c_str()}}, &d, nullptr)) << id;
     }
