@@ -104,7 +104,7 @@ struct line_batch {
             if (end != 1) break;
             if (acles[n].type == 0) continue;  // blank or comment line
             acl__entry_parts_known(acles[n], ctx.mechlen, ctx.idlen, &parts[n]);
-            parts[n].text = borrow;
+            if (acl__type_has_id(acles[n].type)) parts[n].text = borrow;
             lines[n++] = *lineno - 1;          // the parser has counted the line it consumed
         }
         next_line = *lineno;

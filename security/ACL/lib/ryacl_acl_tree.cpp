@@ -513,8 +513,8 @@ int32_t create(const new_entry &ne, tree **node, acl__pool *pool) {
     t->big = nullptr;
     t->type = ne.type;
     t->mechlen = static_cast<unsigned char>(mechlen);
-    t->e0_in_text = ne.text != nullptr;
-    t->e0_text_off = ne.text ? static_cast<uint32_t>(ne.id - ne.text) : 0;
+    t->e0_in_text = ne.text && has_id(ne.type);
+    t->e0_text_off = t->e0_in_text ? static_cast<uint32_t>(ne.id - ne.text) : 0;
     char *p = inline_bytes(t);
     std::memcpy(p, ne.mech, mechlen);
     p[mechlen] = '\0';
@@ -617,7 +617,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
 
     // A new entry: make room everywhere before changing anything.
     const bool own = has_mech(t->type) && !same_spelling(t, ne.mech);
-    const bool borrow = b->borrowed && ne.text == b->arena && !own;
+    const bool borrow = b->borrowed && ne.text == b->arena && has_id(t->type) && !own;
     if (b->borrowed && !borrow)
         if (int32_t rc = unborrow(b)) return rc;
     const size_t add = borrow ? 0 : (own ? t->mechlen + 1 : 0) + ne.idlen + 1;

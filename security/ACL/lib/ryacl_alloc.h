@@ -52,15 +52,18 @@ void *acl__pool_alloc(acl__pool *pool, size_t n, size_t align = 16);
 // Release every chunk; the pool is empty and usable again.
 void acl__pool_release(acl__pool *pool);
 
-// Grow the array *p of capacity *cap to hold `need` elements, doubling, the
-// capacity staying within 32 bits.  False when that cannot be had: *failed
-// is then the size that could not be allocated (SIZE_MAX for one beyond
-// reach) and the array is unchanged.
+// Grow the array *p of capacity *cap to hold `need` elements (doubling,
+// fourfold from 4 MiB), the capacity staying within 32 bits.  False when
+// that cannot be had: *failed is then the size that could not be allocated
+// (SIZE_MAX for one beyond reach) and the array is unchanged.
 template <class T>
 bool acl__grow(T **p, uint32_t *cap, size_t need, size_t *failed) {
     if (need <= *cap) return true;
     size_t nc = *cap ? *cap : 4;
-    while (nc < need) nc = nc > SIZE_MAX / 2 ? SIZE_MAX : nc * 2;
+    // From 4 MiB on, fourfold: each move copies the array into fresh pages,
+    // which cost more than address space never touched.
+    const size_t factor = nc * sizeof(T) >= (size_t{4} << 20) ? 4 : 2;
+    while (nc < need) nc = nc > SIZE_MAX / factor ? SIZE_MAX : nc * factor;
     if (nc > UINT32_MAX) nc = UINT32_MAX;
     if (nc < need || nc > SIZE_MAX / sizeof(T)) {
         *failed = SIZE_MAX;
