@@ -23,7 +23,11 @@
 // written after creation, so any number of threads evaluate through it.
 #include <sys/auxv.h>
 
+#include <cstddef>
 #include <cstring>
+#ifdef __SSE2__
+#include <emmintrin.h>
+#endif
 
 #include "ry_zo_int.h"
 #include "ryacl_acl_buffer.h"
@@ -63,44 +67,41 @@ uint64_t process_seed() {
     return seed;
 }
 
-// The first 16 bytes of an identifier as the comparison sees them: ASCII
-// capitals folded, bytes past its end zero.  Read whole words from a text
-// with at least 16 readable bytes (the index's copy is padded for this), or
-// from a stack copy of a caller's shorter text.
-struct head16 {
-    uint64_t a, b;
+// The first 32 bytes of an identifier as the comparison sees them: ASCII
+// capitals folded, bytes past its end zero.
+struct head32 {
+    uint64_t a, b, c, d;
 };
-inline uint64_t low_bytes(uint64_t w, size_t n) { return n >= 8 ? w : w & ((uint64_t{1} << (8 * n)) - 1); }
-inline head16 head_padded(const char *p, size_t len) {
-    return {zo::fold8(low_bytes(zo::load8(p), len)), zo::fold8(low_bytes(zo::load8(p + 8), len > 8 ? len - 8 : 0))};
-}
-inline head16 head_of(const char *p, size_t len) {
-    if (len >= 16) return head_padded(p, len);
-    char buf[16] = {};
-    std::memcpy(buf, p, len);
-    return head_padded(buf, len);
+inline head32 head_of(const char *p, size_t len) {
+    char buf[32] = {};
+    std::memcpy(buf, p, len < 32 ? len : 32);
+    return {zo::fold8(zo::load8(buf)), zo::fold8(zo::load8(buf + 8)), zo::fold8(zo::load8(buf + 16)),
+            zo::fold8(zo::load8(buf + 24))};
 }
 
 // Hash of an identifier as the comparison sees it, so identifiers that
-// compare equal hash equal.  Past 16 bytes, 8 at a time.
-// `padded`: whole words may be read past the end, as in the copy.
-template <bool padded>
-uint64_t text_hash(const head16 &k, const char *p, size_t len, uint64_t seed) {
-    // Both halves keyed: no chosen text can zero a factor for every seed.
-    uint64_t h = mum(k.a ^ seed, k.b ^ seed ^ kMixA);
-    if (len <= 16) return h;
-    for (size_t i = 16; i < len; i += 8) {
+// compare equal hash equal: its head in two independent products, then 8
+// bytes at a time past 32.
+inline uint64_t head_hash(const head32 &k, size_t len, uint64_t seed) {
+    // Every factor keyed: no chosen text can zero one for every seed.
+    return mum(k.a ^ seed, k.b ^ seed ^ kMixA) + mum(k.c ^ seed ^ kMixB, k.d ^ kMixC ^ len);
+}
+uint64_t text_hash(const head32 &k, const char *p, size_t len, uint64_t seed) {
+    uint64_t h = head_hash(k, len, seed);
+    for (size_t i = 32; i < len; i += 8) {
         uint64_t w = 0;
-        if constexpr (padded) w = low_bytes(zo::load8(p + i), len - i);
-        else std::memcpy(&w, p + i, len - i < 8 ? len - i : 8);
+        std::memcpy(&w, p + i, len - i < 8 ? len - i : 8);
         h = mum(h ^ zo::fold8(w), kMixB);
     }
-    return mum(h, kMixC ^ len);
+    return h;
 }
 
-// Order of two identifiers as the comparison gives it, from their heads
-// where those differ.
-inline int order(const head16 &x, const char *p, size_t plen, const head16 &y, const char *q, size_t qlen) {
+// Order of two identifiers as the comparison gives it, from the first 16
+// bytes of their heads where those differ.
+struct head16 {
+    uint64_t a, b;
+};
+inline int order(const head32 &x, const char *p, size_t plen, const head16 &y, const char *q, size_t qlen) {
     if (x.a != y.a) return __builtin_bswap64(x.a) < __builtin_bswap64(y.a) ? -1 : 1;
     if (x.b != y.b) return __builtin_bswap64(x.b) < __builtin_bswap64(y.b) ? -1 : 1;
     if (plen <= 16 && qlen <= 16) return 0;
@@ -116,8 +117,12 @@ struct id_slot {
 };
 constexpr uint32_t kReached = 1;
 
+// A table of n slots takes its home slots from the first n - kSpill: the
+// last slots are there so that the four from a home slot on always lie in
+// the table (creation reads them at once).  Probes wrap at n.
+constexpr uint32_t kSpill = 3;
 inline uint32_t slot_of(uint64_t h, uint32_t n) {
-    return static_cast<uint32_t>((static_cast<uint64_t>(static_cast<uint32_t>(h >> 32)) * n) >> 32);
+    return static_cast<uint32_t>((static_cast<uint64_t>(static_cast<uint32_t>(h >> 32)) * (n - kSpill)) >> 32);
 }
 inline bool same_key(uint32_t key, uint64_t h) { return ((key ^ static_cast<uint32_t>(h)) & ~kReached) == 0; }
 
@@ -161,8 +166,11 @@ int plain_slot(unsigned type) {
 
 }  // namespace
 
+// The index is two blocks: one holding this record, the sub-ACL records,
+// the mechanism directory and the identifier tables, zeroed; and the copy
+// of the bytes the walk reads, at the offsets they had in the buffer.
 struct sec_acl_index_s {
-    unsigned char *bytes;  // the copy of the compiled ACL
+    unsigned char *bytes;  // the copy
     uint64_t seed;
     sub_info *subs;
     uint32_t nsubs;
@@ -176,23 +184,9 @@ namespace {
 
 constexpr const char *kCreate = "sec_create_acl_index";
 
-// Zeroed blocks, but for the copy, which is written over at once.
-void *index_alloc(size_t count, size_t size, int32_t *rc, bool zeroed = true) {
-    void *p = zeroed ? acl__calloc(count, size) : acl__malloc(count * size);
-    if (!p) *rc = acl__no_memory(kCreate, static_cast<int32_t>(count * size));
-    return p;
-}
-
-// Zero bytes after the copy: whole-word reads of its last identifier stay
-// inside the block.
-constexpr size_t kPad = 16;
-
 void release(sec_acl_index_s *ix) {
     if (!ix) return;
     std::free(ix->bytes);
-    std::free(ix->subs);
-    std::free(ix->mechs);
-    std::free(ix->slots);
     std::free(ix);
 }
 
@@ -212,112 +206,286 @@ const sub_info *find_sub(const sec_acl_index_s *ix, unsigned type, const char *m
     }
 }
 
-// Record the sub-ACLs the walk can find, in a buffer that validated: the
-// first of each type (and mechanism), the last sub-ACL whatever its length
-// field says.  Returns the identifier slots needed.
-size_t map_subs(sec_acl_index_s *ix) {
-    const unsigned char *p = ix->bytes;
+// ---- Creation: validation and indexing in one walk -----------------------
+//
+// Creation holds the buffer to every rule validation holds it to, but only
+// asks whether all hold: the first that fails hands the buffer to
+// validation itself, whose record (code, message, arguments) is then the
+// answer.  A buffer that keeps every rule is read once: each entry is
+// checked, hashed, entered in its table and copied while it is in the
+// cache.
+
+// Slots of an identifier table of n entries: loaded to at most two thirds,
+// so a miss ends within a few slots.
+inline size_t table_size(uint32_t n) { return size_t{n} + n / 2 + 1 + kSpill; }
+
+// The header of the sub-ACL at pos keeps validation's rules: it and its
+// length lie in the block, its type is known, its mechanism field is right
+// for the type and lies in the block, and its count fits in its room (each
+// entry takes its header, and with an identifier at least a NUL).  The
+// room of a sub-ACL but the last is its length, since the next must begin
+// where its entries end: the counts of all sub-ACLs together stay within
+// the block, and so does what is allocated for them.
+bool header_ok(const unsigned char *p, size_t len, size_t pos, bool last) {
+    if (!acl__fits(pos, ACL_SUBACL_HDR_SIZE, len)) return false;
+    const size_t length = acl__load_le32(p + pos);
+    if (length > len - pos) return false;
+    const unsigned type = p[pos + 4], mlen = p[pos + 9];
+    const uint32_t count = acl__load_le32(p + pos + 5);
+    if (!acl__valid_type(type)) return false;
+    if (acl__type_has_mech(type)) {
+        if (mlen < 2 || mlen > 17 || !acl__fits(pos + ACL_SUBACL_HDR_SIZE, mlen, len)) return false;
+        if (strnlen(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen) + 1 != mlen) return false;
+    } else if (mlen != 0 || (!acl__type_has_id(type) && count > 1)) {
+        return false;
+    }
+    const size_t room = last ? len - pos : length;
+    if (room < ACL_SUBACL_HDR_SIZE + mlen) return false;
+    return count <= (room - ACL_SUBACL_HDR_SIZE - mlen) / (ACL_ENTRY_HDR_SIZE + (acl__type_has_id(type) ? 1u : 0u));
+}
+
+// Every sub-ACL header keeps its rules; *nslots: the slots the user and
+// group sub-ACLs could need (a later sub-ACL of a type and mechanism met
+// before is counted and never filled).
+bool headers_ok(const unsigned char *p, size_t len, size_t *nslots) {
+    const unsigned nsub = acl__load_le16(p + 3);
+    size_t pos = ACL_HDR_SIZE;
+    *nslots = 0;
+    for (unsigned k = 0; k < nsub; ++k) {
+        if (!header_ok(p, len, pos, k + 1 == nsub)) return false;
+        const unsigned type = p[pos + 4];
+        if (type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP)
+            *nslots += table_size(acl__load_le32(p + pos + 5));
+        pos += acl__load_le32(p + pos);
+    }
+    return true;
+}
+
+// The record of the sub-ACL at pos when the walk can find it (the first of
+// its type, and mechanism), its first entry and count filled in; null for a
+// later one.
+sub_info *claim(sec_acl_index_s *ix, const unsigned char *p, size_t pos) {
+    const unsigned type = p[pos + 4];
+    const size_t mlen = p[pos + 9];
+    uint32_t *owner;
+    if (!acl__type_has_mech(type)) {
+        owner = &ix->by_type[plain_slot(type)];
+    } else {
+        uint64_t w[2] = {};
+        mech_key(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen - 1, w);
+        uint32_t i = static_cast<uint32_t>(mech_hash(w, type, ix->seed)) & ix->mech_mask;
+        for (; ix->mechs[i].sub; i = (i + 1) & ix->mech_mask) {
+            const mech_slot &m = ix->mechs[i];
+            if (m.type == type && m.w[0] == w[0] && m.w[1] == w[1]) return nullptr;
+        }
+        mech_slot &m = ix->mechs[i];
+        m.w[0] = w[0];
+        m.w[1] = w[1];
+        m.type = type;
+        owner = &m.sub;
+    }
+    if (*owner) return nullptr;
+    sub_info &s = ix->subs[ix->nsubs];
+    *owner = ++ix->nsubs;
+    s.first = static_cast<uint32_t>(pos + ACL_SUBACL_HDR_SIZE + mlen);
+    s.count = acl__load_le32(p + pos + 5);
+    return &s;
+}
+
+// Copies the buffer's bytes into the index a stretch behind the walk, while
+// they are still in the cache.
+struct copier {
+    static constexpr size_t kStretch = 64 << 10;
+    const unsigned char *from;
+    unsigned char *to;
+    size_t done = 0;
+    void upto(size_t pos) {
+        std::memcpy(to + done, from + done, pos - done);
+        done = pos;
+    }
+    void follow(size_t pos) {
+        if (pos - done >= kStretch) upto(pos);
+    }
+};
+
+// The entries of a sub-ACL no table is made for, held to validation's
+// rules.  Where they end; 0 when a rule fails.
+size_t check_entries(const unsigned char *p, size_t len, size_t pos, uint32_t count, bool has_id, copier &c) {
+    for (uint32_t k = 0; k < count; ++k) {
+        if (!acl__fits(pos, ACL_ENTRY_HDR_SIZE, len) || p[pos] != 1) return 0;
+        const size_t idlen = acl__load_le16(p + pos + 5);
+        pos += ACL_ENTRY_HDR_SIZE;
+        if (has_id ? idlen == 0 || idlen > len - pos ||
+                         strnlen(reinterpret_cast<const char *>(p + pos), idlen) + 1 != idlen
+                   : idlen != 0)
+            return 0;
+        pos += idlen;
+        c.follow(pos);
+    }
+    return pos;
+}
+
+// Head and hash of an identifier of n bytes with `room` readable bytes from
+// its start (at least n + 1).  False unless its only NUL is at n, as
+// validation requires.  Identifiers under 32 bytes with 32 readable are
+// read in two vectors, without a branch on their length (a mix of lengths
+// would mispredict it); others a byte at a time.
+inline bool scan_id(const char *id, size_t n, size_t room, uint64_t seed, head32 *head, uint64_t *h) {
+#ifdef __SSE2__
+    if (n < 32 && room >= 32) {
+        // 32 bytes kept, then 32 dropped: from 32 - n on, the first n bytes of 32.
+        alignas(64) static constexpr unsigned char kKeep[64] = {
+            255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255,
+            255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255, 255};
+        const __m128i lo = _mm_loadu_si128(reinterpret_cast<const __m128i *>(id));
+        const __m128i hi = _mm_loadu_si128(reinterpret_cast<const __m128i *>(id + 16));
+        const __m128i zero = _mm_setzero_si128();
+        const uint32_t zeros = static_cast<uint32_t>(_mm_movemask_epi8(_mm_cmpeq_epi8(lo, zero))) |
+                               static_cast<uint32_t>(_mm_movemask_epi8(_mm_cmpeq_epi8(hi, zero))) << 16;
+        // The first NUL at n: the bit of n is the lowest set.
+        if ((zeros & ((uint32_t{2} << n) - 1)) != uint32_t{1} << n) return false;
+        const __m128i above = _mm_set1_epi8('A' - 1), below = _mm_set1_epi8('Z' + 1), bit = _mm_set1_epi8(0x20);
+        auto fold = [&](__m128i x, const unsigned char *keep) {
+            const __m128i upper = _mm_and_si128(_mm_cmpgt_epi8(x, above), _mm_cmpgt_epi8(below, x));
+            x = _mm_or_si128(x, _mm_and_si128(upper, bit));
+            return _mm_and_si128(x, _mm_loadu_si128(reinterpret_cast<const __m128i *>(keep)));
+        };
+        const __m128i flo = fold(lo, kKeep + 32 - n), fhi = fold(hi, kKeep + 48 - n);
+        *head = {static_cast<uint64_t>(_mm_cvtsi128_si64(flo)),
+                 static_cast<uint64_t>(_mm_cvtsi128_si64(_mm_unpackhi_epi64(flo, flo))),
+                 static_cast<uint64_t>(_mm_cvtsi128_si64(fhi)),
+                 static_cast<uint64_t>(_mm_cvtsi128_si64(_mm_unpackhi_epi64(fhi, fhi)))};
+        *h = head_hash(*head, n, seed);
+        return true;
+    }
+#endif
+    if (strnlen(id, n + 1) != n) return false;
+    *head = head_of(id, n);
+    *h = text_hash(*head, id, n, seed);
+    return true;
+}
+
+// An entry on its way into a table: its key, its offset, its home slot.
+struct pending {
+    uint32_t key, off, slot;
+};
+
+// Whether the identifiers of the entries at offsets a and b are the same.
+inline bool same_id(const unsigned char *p, uint32_t a, uint32_t b) {
+    return zo::casecmp_len(reinterpret_cast<const char *>(p + a + ACL_ENTRY_HDR_SIZE), acl__load_le16(p + a + 5) - 1u,
+                           reinterpret_cast<const char *>(p + b + ACL_ENTRY_HDR_SIZE),
+                           acl__load_le16(p + b + 5) - 1u) == 0;
+}
+
+// Enter one entry unless an earlier entry of its identifier is there: a
+// later one is never the walk's answer.  The four slots from its home are
+// looked at together: when one is empty and no key before it is the
+// entry's, the entry goes there without a branch on which one (a third of
+// home slots are taken by then, at random).
+inline void insert(const unsigned char *p, id_slot *t, uint32_t n, const pending &e) {
+#ifdef __SSE2__
+    static_assert(sizeof(id_slot) == 8 && offsetof(id_slot, off) == 4 && kSpill == 3);
+    const __m128 s01 = _mm_castsi128_ps(_mm_loadu_si128(reinterpret_cast<const __m128i *>(t + e.slot)));
+    const __m128 s23 = _mm_castsi128_ps(_mm_loadu_si128(reinterpret_cast<const __m128i *>(t + e.slot + 2)));
+    const __m128i offs = _mm_castps_si128(_mm_shuffle_ps(s01, s23, _MM_SHUFFLE(3, 1, 3, 1)));
+    const __m128i keys = _mm_castps_si128(_mm_shuffle_ps(s01, s23, _MM_SHUFFLE(2, 0, 2, 0)));
+    const auto key_bits = static_cast<int>(~kReached);
+    const unsigned empty = static_cast<unsigned>(
+        _mm_movemask_ps(_mm_castsi128_ps(_mm_cmpeq_epi32(offs, _mm_setzero_si128()))));
+    const unsigned same = static_cast<unsigned>(_mm_movemask_ps(_mm_castsi128_ps(_mm_cmpeq_epi32(
+        _mm_and_si128(keys, _mm_set1_epi32(key_bits)), _mm_set1_epi32(static_cast<int>(e.key) & key_bits)))));
+    const unsigned first = static_cast<unsigned>(__builtin_ctz(empty | 16u));
+    if (first < 4 && (same & ((1u << first) - 1)) == 0) {
+        t[e.slot + first] = {e.key, e.off};
+        return;
+    }
+#endif
+    for (uint32_t i = e.slot;; i = i + 1 == n ? 0 : i + 1) {
+        id_slot &slot = t[i];
+        if (!slot.off) {
+            slot.key = e.key;
+            slot.off = e.off;
+            return;
+        }
+        if (((slot.key ^ e.key) & ~kReached) == 0 && same_id(p, slot.off, e.off)) return;
+    }
+}
+
+// The entries of a user or group sub-ACL the walk can find: held to
+// validation's rules and entered in its table of n slots, in order.  Each
+// entry's slot is fetched kAhead entries before it is entered, so the
+// table's cache misses overlap instead of following one another.  Where
+// the entries end; 0 when a rule fails.
+size_t fill_entries(const unsigned char *p, size_t len, size_t pos, uint32_t count, id_slot *t, uint32_t n,
+                    uint64_t seed, copier &c) {
+    constexpr uint32_t kAhead = 32;
+    pending ring[kAhead];
+    head16 top{};  // the highest identifier so far
+    const char *topid = nullptr;
+    size_t toplen = 0;
+    for (uint32_t k = 0; k < count; ++k) {
+        if (!acl__fits(pos, ACL_ENTRY_HDR_SIZE, len) || p[pos] != 1) return 0;
+        const size_t idlen = acl__load_le16(p + pos + 5), at = pos + ACL_ENTRY_HDR_SIZE;
+        if (idlen == 0 || idlen > len - at) return 0;
+        const char *id = reinterpret_cast<const char *>(p + at);
+        const size_t idl = idlen - 1;
+        head32 head;
+        uint64_t h;
+        if (!scan_id(id, idl, len - at, seed, &head, &h)) return 0;
+        const bool reached = !topid || order(head, id, idl, top, topid, toplen) > 0;
+        if (reached) top = {head.a, head.b}, topid = id, toplen = idl;
+        const uint32_t slot = slot_of(h, n);
+        // The four slots from the home may end on the next line.
+        __builtin_prefetch(t + slot, 1);
+        __builtin_prefetch(t + slot + kSpill, 1);
+        pending &r = ring[k % kAhead];
+        if (k >= kAhead) insert(p, t, n, r);
+        r = {(static_cast<uint32_t>(h) & ~kReached) | (reached ? kReached : 0), static_cast<uint32_t>(pos), slot};
+        pos = at + idlen;
+        c.follow(pos);
+    }
+    for (uint32_t k = count > kAhead ? count - kAhead : 0; k < count; ++k) insert(p, t, n, ring[k % kAhead]);
+    return pos;
+}
+
+// Walk a buffer whose headers keep their rules: every entry checked, the
+// sub-ACLs the walk can find recorded, their tables filled, the bytes up to
+// the end of the last entries copied.  False when a rule fails.
+bool build(sec_acl_index_s *ix, const unsigned char *p, size_t len) {
+    copier c{p, ix->bytes};
     const unsigned nsub = acl__load_le16(p + 3);
     size_t pos = ACL_HDR_SIZE, nslots = 0;
     for (unsigned k = 0; k < nsub; ++k) {
         const unsigned type = p[pos + 4];
-        const size_t mlen = p[pos + 9];
-        const bool by_mech = acl__type_has_mech(type);
-        uint32_t *owner = nullptr;
-        mech_slot *ms = nullptr;
-        if (!by_mech) {
-            owner = &ix->by_type[plain_slot(type)];
-            if (*owner) owner = nullptr;
+        const size_t first = pos + ACL_SUBACL_HDR_SIZE + p[pos + 9];
+        const uint32_t count = acl__load_le32(p + pos + 5);
+        sub_info *s = claim(ix, p, pos);
+        size_t end;
+        if (s && (type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP)) {
+            s->slot0 = static_cast<uint32_t>(nslots);
+            s->nslots = static_cast<uint32_t>(table_size(count));
+            nslots += s->nslots;
+            end = fill_entries(p, len, first, count, ix->slots + s->slot0, s->nslots, ix->seed, c);
         } else {
-            uint64_t w[2] = {};
-            mech_key(reinterpret_cast<const char *>(p + pos + ACL_SUBACL_HDR_SIZE), mlen - 1, w);
-            uint32_t i = static_cast<uint32_t>(mech_hash(w, type, ix->seed)) & ix->mech_mask;
-            while (ix->mechs[i].sub && !(ix->mechs[i].type == type && ix->mechs[i].w[0] == w[0] &&
-                                         ix->mechs[i].w[1] == w[1]))
-                i = (i + 1) & ix->mech_mask;
-            if (!ix->mechs[i].sub) {
-                ms = &ix->mechs[i];
-                ms->w[0] = w[0];
-                ms->w[1] = w[1];
-                ms->type = type;
-                owner = &ms->sub;
-            }
+            end = check_entries(p, len, first, count, acl__type_has_id(type), c);
         }
-        if (owner) {
-            sub_info &s = ix->subs[ix->nsubs];
-            *owner = ++ix->nsubs;
-            s.first = static_cast<uint32_t>(pos + ACL_SUBACL_HDR_SIZE + mlen);
-            s.count = acl__load_le32(p + pos + 5);
-            if (type == SEC_ACLE_TYPE_USER || type == SEC_ACLE_TYPE_GROUP) {
-                // Load at most two thirds: a miss ends within a few slots.
-                s.slot0 = static_cast<uint32_t>(nslots);
-                s.nslots = s.count + s.count / 2 + 1;
-                nslots += s.nslots;
-            }
-        }
-        pos += acl__load_le32(p + pos);
+        // Each sub-ACL but the last begins where the entries before it end.
+        if (!end || (k + 1 < nsub && end != pos + acl__load_le32(p + pos))) return false;
+        pos = end;
     }
-    return nslots;
+    c.upto(pos);
+    return true;
 }
 
-// Insert one entry unless an earlier entry of its identifier is there.
-inline void insert(const sec_acl_index_s *ix, id_slot *t, uint32_t n, uint32_t i, uint64_t h, uint32_t key,
-                   uint32_t off, const char *id, size_t len) {
-    for (;; i = i + 1 == n ? 0 : i + 1) {
-        id_slot &slot = t[i];
-        if (!slot.off) {
-            slot.key = key;
-            slot.off = off;
-            return;
-        }
-        // A later entry of the same identifier is never the walk's answer.
-        if (same_key(slot.key, h)) {
-            const unsigned char *o = ix->bytes + slot.off;
-            if (zo::casecmp_len(id, len, reinterpret_cast<const char *>(o + ACL_ENTRY_HDR_SIZE),
-                                acl__load_le16(o + 5) - 1u) == 0)
-                return;
-        }
-    }
-}
+// The refusal of a buffer that broke a rule: validation's own record.
+int32_t refuse(sec_acl_buffer_t acl) { return sec_convert_acl_to_host(1, acl); }
 
-// Fill one sub-ACL's identifier table from its entries, in order.  Entries
-// go in by batches whose slots are fetched ahead, so the table's cache
-// misses overlap instead of following one another.
-void fill_table(const sec_acl_index_s *ix, const sub_info &s) {
-    constexpr uint32_t kBatch = 16;
-    struct pending {
-        uint64_t h;
-        uint32_t key, off, slot;
-        const char *id;
-        size_t len;
-    } batch[kBatch];
-    id_slot *t = ix->slots + s.slot0;
-    const unsigned char *e = ix->bytes + s.first;
-    head16 top{};  // the highest identifier so far
-    const char *topid = nullptr;
-    size_t toplen = 0;
-    for (uint32_t done = 0; done < s.count;) {
-        const uint32_t n = s.count - done < kBatch ? s.count - done : kBatch;
-        for (uint32_t k = 0; k < n; ++k) {
-            const size_t idlen = acl__load_le16(e + 5);
-            const char *id = reinterpret_cast<const char *>(e + ACL_ENTRY_HDR_SIZE);
-            const size_t len = idlen - 1;
-            const head16 head = head_padded(id, len);
-            const bool reached = !topid || order(head, id, len, top, topid, toplen) > 0;
-            if (reached) top = head, topid = id, toplen = len;
-            const uint64_t h = text_hash<true>(head, id, len, ix->seed);
-            const uint32_t slot = slot_of(h, s.nslots);
-            __builtin_prefetch(t + slot, 1);
-            batch[k] = {h, (static_cast<uint32_t>(h) & ~kReached) | (reached ? kReached : 0),
-                        static_cast<uint32_t>(e - ix->bytes), slot, id, len};
-            e += ACL_ENTRY_HDR_SIZE + idlen;
-        }
-        for (uint32_t k = 0; k < n; ++k) {
-            const pending &b = batch[k];
-            insert(ix, t, s.nslots, b.slot, b.h, b.key, b.off, b.id, b.len);
-        }
-        done += n;
-    }
+// A block of n bytes could not be had before the walk that checks the
+// entries: a buffer that breaks a rule is still refused as validation
+// refuses it, whatever memory there is.
+int32_t no_memory(sec_acl_buffer_t acl, size_t n) {
+    if (int32_t rc = refuse(acl)) return rc;
+    return acl__no_memory(kCreate, n);
 }
 
 int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
@@ -325,42 +493,40 @@ int32_t create(sec_acl_buffer_t acl, sec_acl_index_t *index) {
     if (!index) return acl::set_error(ACL_RC_BAD_ARGS, acl::msg::BAD_PARAM, kCreate, 2, 0);
     *index = nullptr;
     const auto *p = static_cast<const unsigned char *>(acl->value);
+    if (!p || acl->length < ACL_HDR_SIZE || p[0] != ACL_BUF_TYPE || p[1] != ACL_BUF_VERSION) return refuse(acl);
     // Evaluation refuses a buffer in the other byte order; so does the
     // index, rather than answer for bytes no evaluation would accept.
-    if (acl->length >= ACL_HDR_SIZE && p && p[0] == ACL_BUF_TYPE && p[1] == ACL_BUF_VERSION &&
-        p[2] != ACL_BUF_HOST_ORDER)
-        return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
-    // Every other refusal is the conversion's own record, word for word; on
-    // a host-order buffer it only reads.
-    if (int32_t rc = sec_convert_acl_to_host(1, acl)) return rc;
-
+    if (p[2] != ACL_BUF_HOST_ORDER) return acl::set_error(ACL_RC_BAD_ACL, acl::msg::BAD_BYTE_ORDER);
     const size_t len = static_cast<size_t>(acl->length);
+    size_t nslots;
+    if (!headers_ok(p, len, &nslots)) return refuse(acl);
+
     const unsigned nsub = acl__load_le16(p + 3);
     size_t nmech = 2;
     while (nmech < 2 * size_t{nsub}) nmech *= 2;
-    int32_t rc = 0;
-    auto *ix = static_cast<sec_acl_index_s *>(index_alloc(1, sizeof(sec_acl_index_s), &rc));
-    if (!ix) return rc;
-    ix->seed = process_seed();
+    const size_t subs_at = sizeof(sec_acl_index_s), mechs_at = subs_at + nsub * sizeof(sub_info),
+                 slots_at = mechs_at + nmech * sizeof(mech_slot), size = slots_at + nslots * sizeof(id_slot);
+    static_assert(sizeof(sec_acl_index_s) % alignof(sub_info) == 0 && sizeof(sub_info) % alignof(mech_slot) == 0 &&
+                  sizeof(mech_slot) % alignof(id_slot) == 0);
+    auto *block = static_cast<unsigned char *>(acl__calloc(size, 1));
+    if (!block) return no_memory(acl, size);
+    // Fresh pages would be much of the creation of a large index: fewer,
+    // larger ones where the blocks allow.
+    acl__advise_large(block + slots_at, nslots * sizeof(id_slot));
+    auto *ix = reinterpret_cast<sec_acl_index_s *>(block);
+    ix->subs = reinterpret_cast<sub_info *>(block + subs_at);
+    ix->mechs = reinterpret_cast<mech_slot *>(block + mechs_at);
+    ix->slots = reinterpret_cast<id_slot *>(block + slots_at);
     ix->mech_mask = static_cast<uint32_t>(nmech - 1);
-    if ((ix->bytes = static_cast<unsigned char *>(index_alloc(len + kPad, 1, &rc, false))) &&
-        (ix->subs = static_cast<sub_info *>(index_alloc(nsub ? nsub : 1, sizeof(sub_info), &rc))) &&
-        (ix->mechs = static_cast<mech_slot *>(index_alloc(nmech, sizeof(mech_slot), &rc)))) {
-        // Fresh pages are a third of the creation of a large index: fewer,
-        // larger ones where the blocks allow.
-        acl__advise_large(ix->bytes, len + kPad);
-        std::memcpy(ix->bytes, p, len);
-        std::memset(ix->bytes + len, 0, kPad);
-        const size_t nslots = map_subs(ix);
-        if ((ix->slots = static_cast<id_slot *>(index_alloc(nslots ? nslots : 1, sizeof(id_slot), &rc)))) {
-            acl__advise_large(ix->slots, nslots * sizeof(id_slot));
-            for (uint32_t s = 0; s < ix->nsubs; ++s)
-                if (ix->subs[s].nslots) fill_table(ix, ix->subs[s]);
-        }
-    }
-    if (rc) {
+    ix->seed = process_seed();
+    if (!(ix->bytes = static_cast<unsigned char *>(acl__malloc(len)))) {
         release(ix);
-        return rc;
+        return no_memory(acl, len);
+    }
+    acl__advise_large(ix->bytes, len);
+    if (!build(ix, p, len)) {
+        release(ix);
+        return refuse(acl);
     }
     *index = ix;
     return 0;
@@ -373,7 +539,7 @@ int32_t no_entry(unsigned type, const char *mech, const char *id) {
 // The first entry of `id` in a user or group sub-ACL, when the walk reaches
 // it; null otherwise.
 const unsigned char *probe(const sec_acl_index_s *ix, const sub_info &s, const char *id, size_t len) {
-    const uint64_t h = text_hash<false>(head_of(id, len), id, len, ix->seed);
+    const uint64_t h = text_hash(head_of(id, len), id, len, ix->seed);
     const id_slot *t = ix->slots + s.slot0;
     for (uint32_t i = slot_of(h, s.nslots);; i = i + 1 == s.nslots ? 0 : i + 1) {
         const id_slot &slot = t[i];
