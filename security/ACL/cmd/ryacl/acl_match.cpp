@@ -21,6 +21,11 @@ namespace ryacl {
 namespace {
 
 constexpr uint64_t kMul = 0x9e3779b97f4a7c15ull;
+// A slot: the hash's top 31 bits, a bit set once an OLD entry has been
+// matched (so that a second NEW one finds it without reading old_match at
+// random), then the entry's side << 31 | index, + 1.
+constexpr unsigned kTagShift = 33;
+constexpr uint64_t kMatched = uint64_t{1} << 32;
 
 uint64_t mix(uint64_t h) {
     h ^= h >> 32;
@@ -77,13 +82,18 @@ entry_matcher::entry_matcher(const loaded_acl &o, const loaded_acl &n) : acl_{&o
     new_done.assign(n.items.size(), false);
 }
 
-// The entry named by the first slot a hash probes, when its tag agrees: the
-// one a probe is most likely to compare with.
+// The entry named by the first slot of a hash's probe whose tag agrees (the
+// one the probe will compare with), looking no further than the few slots
+// that share the fetched line; null when none does.
 const acl_item *entry_matcher::first_candidate(uint64_t h) const {
-    const uint64_t v = table_[h & mask_];
-    if (v == 0 || v >> 32 != h >> 32) return nullptr;
-    const uint32_t ref = static_cast<uint32_t>(v) - 1;
-    return &acl_[ref >> 31]->items[ref & 0x7fffffffu];
+    for (uint64_t s = h & mask_, k = 0; k < 4; ++k, s = (s + 1) & mask_) {
+        const uint64_t v = table_[s];
+        if (v == 0) return nullptr;
+        if (v >> kTagShift != h >> kTagShift) continue;
+        const uint32_t ref = static_cast<uint32_t>(v) - 1;
+        return &acl_[ref >> 31]->items[ref & 0x7fffffffu];
+    }
+    return nullptr;
 }
 
 bool entry_matcher::same(int sa, uint32_t a, int sb, uint32_t b) const {
@@ -111,21 +121,21 @@ int32_t entry_matcher::add_side(int side) {
             if (const acl_item *e = first_candidate(hashes[i + kIdAhead])) __builtin_prefetch(e->id);
         }
         const uint64_t h = hashes[i];
-        const uint64_t tag = h >> 32;
+        const uint64_t tag = h >> kTagShift;
         const uint32_t me = static_cast<uint32_t>(i);
         uint64_t s = h & mask_;
         for (;; s = (s + 1) & mask_) {
             const uint64_t v = table_[s];
             if (v == 0) {
-                table_[s] = tag << 32 | ((uint64_t{static_cast<uint32_t>(side)} << 31 | me) + 1);
+                table_[s] = tag << kTagShift | ((uint64_t{static_cast<uint32_t>(side)} << 31 | me) + 1);
                 break;
             }
-            if (v >> 32 != tag) continue;
+            if (v >> kTagShift != tag) continue;
             const uint32_t ref = static_cast<uint32_t>(v) - 1;
             const int rs = static_cast<int>(ref >> 31);
             const uint32_t ri = ref & 0x7fffffffu;
             if (!same(rs, ri, side, me)) continue;
-            if (rs == side || (side == 1 && old_match[ri] != kNone)) {
+            if (rs == side || (side == 1 && (v & kMatched))) {
                 // The key is already on this side.
                 if (!acl.compiled) {
                     const acl_item &first = rs == side ? acl.items[ri] : acl.items[old_match[ri] - 1];
@@ -136,6 +146,7 @@ int32_t entry_matcher::add_side(int side) {
                 break;
             }
             old_match[ri] = me + 1;
+            table_[s] = v | kMatched;
             new_done[me] = true;
             break;
         }

@@ -34,7 +34,7 @@ private:
     const acl_item *first_candidate(uint64_t h) const;
 
     const loaded_acl *acl_[2];
-    std::vector<uint64_t> table_;        // tag << 32 | (side << 31 | index) + 1; 0 empty
+    std::vector<uint64_t> table_;        // tag << 33 | matched << 32 | (side << 31 | index) + 1; 0 empty
     uint64_t mask_ = 0;
 };
 
