@@ -93,8 +93,9 @@ struct line_batch {
     int32_t next_line = 1;  // the line after the batch
     acl__line_fault fault;
 
-    void fill(const acl__textfile_opts &o, const unsigned char *classes, const char *borrow, char **cursor,
-              size_t *left, int32_t *lineno) {
+    // `last`: the entry added just before this batch's first, if known.
+    void fill(const acl__textfile_opts &o, const unsigned char *classes, const char *borrow,
+              const sec_acle_desc *last, char **cursor, size_t *left, int32_t *lineno) {
         n = 0;
         end = 1;
         acl__line_ctx ctx;
@@ -104,6 +105,10 @@ struct line_batch {
             if (end != 1) break;
             if (acles[n].type == 0) continue;  // blank or comment line
             acl__entry_parts_known(acles[n], ctx.mechlen, ctx.idlen, &parts[n]);
+            // Records the parser made: their whole mechanism fields compare.
+            const sec_acle_desc &prev = n > 0 ? acles[n - 1] : *last;
+            parts[n].same_key_as_previous = (n > 0 || last) && prev.type == acles[n].type &&
+                                            std::memcmp(prev.mech, acles[n].mech, sizeof prev.mech) == 0;
             if (acl__type_has_id(acles[n].type)) parts[n].text = borrow;
             lines[n++] = *lineno - 1;          // the parser has counted the line it consumed
         }
@@ -138,12 +143,12 @@ int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o,
         borrow = trees->text = text;
     line_batch b[2];
     line_batch *cur = &b[0], *ahead = &b[1];
-    cur->fill(o, classes, borrow, &cursor, &left, &lineno);
+    cur->fill(o, classes, borrow, nullptr, &cursor, &left, &lineno);
     acl__trees_prefetch(trees, cur->parts, cur->n);
     for (;;) {
         ahead->n = 0;
         if (cur->end == 1) {
-            ahead->fill(o, classes, borrow, &cursor, &left, &lineno);
+            ahead->fill(o, classes, borrow, &cur->acles[cur->n - 1], &cursor, &left, &lineno);  // cur is full
             acl__trees_prefetch(trees, ahead->parts, ahead->n);
         }
         for (size_t k = 0; k < cur->n; ++k) {
@@ -172,7 +177,9 @@ int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o,
             // memory, that is no fault of the file and ends the parse anyway.
             if (!o.keep_going || rc == ACL_RC_NO_MEMORY) return rc;
             res->clean = false;
-            cur->fill(o, classes, borrow, &cursor, &left, &lineno);
+            sec_acle_desc last{};
+            if (cur->n > 0) last = cur->acles[cur->n - 1];
+            cur->fill(o, classes, borrow, cur->n > 0 ? &last : nullptr, &cursor, &left, &lineno);
             acl__trees_prefetch(trees, cur->parts, cur->n);
             continue;
         }

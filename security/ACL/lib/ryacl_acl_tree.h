@@ -127,6 +127,10 @@ struct acl__entry_parts {
     // The hash of its sub-ACL's key (acl__subacl_key_hash), once taken.
     uint32_t keyhash = 0;
     bool keyhashed = false;
+    // Its type and mechanism bytes are those of the entry added just
+    // before it (which the parser knows at no cost): its sub-ACL is that
+    // entry's, found and checked already.
+    bool same_key_as_previous = false;
     // A text that holds id NUL-terminated, less than 4 GiB from its start,
     // and outlives the tree: the tree may keep id where it is.
     const char *text = nullptr;

@@ -108,10 +108,12 @@ void acl__trees_prefetch(const acl__trees_s *trees, acl__entry_parts *parts, siz
     // the insertion reads in the tree.  The tree found is a hint, checked
     // when the entry is added (two keys may share a hash).
     for (size_t k = 0; k < n; ++k) {
-        keys[k] = acl__subacl_key_hash(parts[k].type, parts[k].mech, parts[k].mechlen);
+        keys[k] = k > 0 && parts[k].same_key_as_previous
+                      ? keys[k - 1]
+                      : acl__subacl_key_hash(parts[k].type, parts[k].mech, parts[k].mechlen);
         parts[k].keyhash = keys[k];
         parts[k].keyhashed = true;
-        __builtin_prefetch(&x->slots[slot_of(keys[k], x->mask)]);
+        if (k == 0 || keys[k] != keys[k - 1]) __builtin_prefetch(&x->slots[slot_of(keys[k], x->mask)]);
     }
     for (size_t k = 0; k < n; ++k) {
         parts[k].tree_slot = k > 0 && keys[k] == keys[k - 1] ? parts[k - 1].tree_slot : candidate(x, keys[k]);
@@ -154,8 +156,12 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     if (!x->slots && trees->nooftrees > 0)
         if (int32_t rc = index_room(x, trees, 0)) return rc;
     const uint32_t h = ne.keyhashed ? ne.keyhash : acl__subacl_key_hash(ne.type, ne.mech, ne.mechlen);
+    // The previous entry's tree, where this one's key is byte for byte the
+    // previous one's, needs no second look.
+    const bool as_previous = ne.same_key_as_previous && ne.tree_slot == x->last && h == x->last_hash;
     const int32_t found = ne.tree_slot >= 0 && ne.tree_slot < trees->nooftrees &&
-                                  acl__tree_holds(trees->trees[ne.tree_slot], ne.type, ne.mech, ne.mechlen)
+                                  (as_previous ||
+                                   acl__tree_holds(trees->trees[ne.tree_slot], ne.type, ne.mech, ne.mechlen))
                               ? ne.tree_slot
                               : find_tree(trees, x, ne, h);
     if (found >= 0) {
