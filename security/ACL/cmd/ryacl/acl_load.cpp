@@ -41,15 +41,24 @@ int out_of_memory_guard(const char *subcommand, const std::function<int()> &run)
 }
 
 int32_t loaded_acl::add_text(char *text, size_t size) {
+    // Room for a line each, so a large file is not copied as it grows.
+    size_t lines = 1;
+    for (const char *p = text, *end = text + size;
+         (p = static_cast<const char *>(std::memchr(p, '\n', static_cast<size_t>(end - p)))) != nullptr; ++p)
+        ++lines;
+    items.reserve(items.size() + lines);
     char *cursor = text;
     size_t left = size + 1;  // the terminating NUL counts
     int32_t lineno = 1;
+    acl__line_ctx ctx;
+    ctx.classes = acl__line_classes();
     for (;;) {
         const int32_t line = lineno;
         sec_acle_desc acle{};
-        int32_t rc = sec__read_acle_from_text(&acl__default_perm_set, &cursor, &left, &lineno, &acle);
+        acl__line_fault fault;
+        int32_t rc = acl__read_acle_deferred(&acl__default_perm_set, &cursor, &left, &lineno, &acle, &fault, &ctx);
         if (rc == 0) return 0;
-        if (rc != 1) return rc;
+        if (rc != 1) return acl__record_line_fault(fault);
         if (acle.type == 0) continue;
         acl_item e{};
         e.type = acle.type;
@@ -58,7 +67,7 @@ int32_t loaded_acl::add_text(char *text, size_t size) {
         std::memcpy(e.mech, acle.mech, sizeof e.mech);
         e.mech[16] = '\0';
         e.id = acle.id;
-        e.idlen = acle.id ? static_cast<uint32_t>(std::strlen(acle.id)) : 0;
+        e.idlen = acle.id ? static_cast<uint32_t>(ctx.idlen) : 0;
         items.push_back(e);
     }
 }

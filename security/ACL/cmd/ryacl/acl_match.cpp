@@ -115,7 +115,11 @@ int32_t entry_matcher::add_side(int side) {
     for (size_t i = 0; i < n; ++i) {
         if (i + kSlotAhead < n) __builtin_prefetch(&table_[hashes[i + kSlotAhead] & mask_]);
         if (i + kEntryAhead < n) {
-            if (const acl_item *e = first_candidate(hashes[i + kEntryAhead])) __builtin_prefetch(e);
+            if (const acl_item *e = first_candidate(hashes[i + kEntryAhead])) {
+                // An item may straddle two lines; the comparison reads all of it.
+                __builtin_prefetch(e);
+                __builtin_prefetch(reinterpret_cast<const char *>(e + 1) - 1);
+            }
         }
         if (i + kIdAhead < n) {
             if (const acl_item *e = first_candidate(hashes[i + kIdAhead])) __builtin_prefetch(e->id);
