@@ -80,6 +80,7 @@ entry_matcher::entry_matcher(const loaded_acl &o, const loaded_acl &n) : acl_{&o
     mask_ = cap - 1;
     old_match.assign(o.items.size(), kNone);
     new_done.assign(n.items.size(), false);
+    old_changed.assign(o.items.size(), false);
 }
 
 // The entry named by the first slot of a hash's probe whose tag agrees (the
@@ -150,6 +151,7 @@ int32_t entry_matcher::add_side(int side) {
                 break;
             }
             old_match[ri] = me + 1;
+            old_changed[ri] = acl_[0]->items[ri].perm != acl.items[me].perm;
             table_[s] = v | kMatched;
             new_done[me] = true;
             break;

@@ -27,6 +27,10 @@ public:
     std::vector<uint32_t> old_match;
     // Per NEW entry: true when it matched an OLD one or is shadowed.
     std::vector<bool> new_done;
+    // Per OLD entry: true when its match grants other permissions (told
+    // while both entries are at hand, so that the differences need not
+    // visit the NEW entries again at random).
+    std::vector<bool> old_changed;
 
 private:
     int32_t add_side(int side);

@@ -143,7 +143,7 @@ int32_t compare(const loaded_acl &o, const loaded_acl &n, std::vector<difference
         const uint32_t j = m.old_match[i];
         if (j == ryacl::entry_matcher::kShadowed) continue;
         if (j == ryacl::entry_matcher::kNone) diffs.push_back({change::removed, &o.items[i], nullptr});
-        else if (o.items[i].perm != n.items[j - 1].perm)
+        else if (m.old_changed[i])
             diffs.push_back({change::changed, &o.items[i], &n.items[j - 1]});
     }
     for (size_t j = 0; j < n.items.size(); ++j)
