@@ -106,9 +106,9 @@ struct line_batch {
             if (acles[n].type == 0) continue;  // blank or comment line
             acl__entry_parts_known(acles[n], ctx.mechlen, ctx.idlen, &parts[n]);
             // Records the parser made: their whole mechanism fields compare.
-            const sec_acle_desc &prev = n > 0 ? acles[n - 1] : *last;
-            parts[n].same_key_as_previous = (n > 0 || last) && prev.type == acles[n].type &&
-                                            std::memcmp(prev.mech, acles[n].mech, sizeof prev.mech) == 0;
+            const sec_acle_desc *prev = n > 0 ? &acles[n - 1] : last;
+            parts[n].same_key_as_previous = prev && prev->type == acles[n].type &&
+                                            std::memcmp(prev->mech, acles[n].mech, sizeof prev->mech) == 0;
             if (acl__type_has_id(acles[n].type)) parts[n].text = borrow;
             lines[n++] = *lineno - 1;          // the parser has counted the line it consumed
         }
