@@ -79,6 +79,7 @@ outcome compare(const loaded_acl &o, const loaded_acl &n) {
         expect(o.items[i].type == n.items[j - 1].type, "a match of the same type");
         r.pairs.insert({i, j - 1});
         r.changed += o.items[i].perm != n.items[j - 1].perm;
+        expect(m.old_changed[i] == (o.items[i].perm != n.items[j - 1].perm), "a changed pair is marked as one");
     }
     for (uint32_t j = 0; j < n.items.size(); ++j)
         if (!m.new_done[j]) r.added.insert(j);
