@@ -444,7 +444,7 @@ void summary() {
 
 int main(int argc, char **argv) {
     if (argc == 3 && (std::strcmp(argv[1], "--floor-of") == 0 || std::strcmp(argv[1], "--huge-floor-of") == 0)) {
-        std::printf("%zu\n", floor_once(argv[2], argv[1][2] == 'h'));
+        std::printf("%zu\n", floor_once(argv[2], std::strcmp(argv[1], "--huge-floor-of") == 0));
         return 0;
     }
     register_all();

@@ -138,8 +138,8 @@ int32_t acl__parse_acltext(char *text, size_t size, const acl__textfile_opts &o,
     // Identifiers stay in the text where the caller keeps it and the trees
     // borrow from no other (offsets into it are 32 bits).
     const char *borrow = nullptr;
-    if (o.trees_borrow_text && trees && size < UINT32_MAX && (!trees->text || trees->text == text) &&
-        (trees->text || trees->nooftrees == 0))
+    if (o.trees_borrow_text && trees && size < UINT32_MAX &&
+        (trees->text ? trees->text == text : trees->nooftrees == 0))
         borrow = trees->text = text;
     line_batch b[2];
     line_batch *cur = &b[0], *ahead = &b[1];

@@ -433,9 +433,8 @@ int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullp
     return 0;
 }
 
-// The sign of the latest entry's identifier against id.
-int against_latest(const big_part *b, const char *id, size_t idlen) {
-    const uint64_t k = order_key(id, idlen);
+// The sign of the latest entry's identifier against id, whose order_key is k.
+int against_latest(const big_part *b, uint64_t k, const char *id, size_t idlen) {
     if (k && b->last_key && k != b->last_key) return b->last_key < k ? -1 : 1;
     const ent &e = b->ents[b->n - 1];
     return zo::casecmp_len(b->arena + e.id_off, e.id_len, id, idlen);
@@ -599,13 +598,16 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
     bool found = false;
     size_t slot = 0;
     int last_cmp = 0;  // previous identifier against the new one
+    uint64_t key = 0;  // the new identifier's order_key, while a run may go on
     if (!has_id(t->type)) {
         uint32_t f = first_present(t);
         if (f < b->n) return duplicate(single, ne, b->ents[f]);
     } else {
         // Once neither direction holds the comparison tells nothing more.
-        if (b->sorted_upto == i || b->descending)
-            last_cmp = against_latest(b, ne.id, ne.idlen);
+        if (b->sorted_upto == i || b->descending) {
+            key = order_key(ne.id, ne.idlen);
+            last_cmp = against_latest(b, key, ne.id, ne.idlen);
+        }
         const bool in_run = (last_cmp < 0 && b->sorted_upto == i) || (last_cmp > 0 && b->descending);
         if (!b->idx && !in_run) {
             if (i > kScanMax) {
@@ -659,7 +661,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
     if (has_id(t->type)) {
         if (b->sorted_upto == i && last_cmp < 0) b->sorted_upto = i + 1;
         b->descending = b->descending && last_cmp > 0;
-        if (b->sorted_upto == i + 1 || b->descending) b->last_key = order_key(ne.id, ne.idlen);
+        if (b->sorted_upto == i + 1 || b->descending) b->last_key = key;  // taken above: a run went on
     }
     b->n = i + 1;
     ++b->n_present;
@@ -680,20 +682,16 @@ int32_t sec__add_acle_to_tree(sec_boolean_t single, const sec_acle_desc *acle, s
 }
 
 bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts) {
-    *parts = acl__entry_parts{};
-    parts->type = acle->type;
-    parts->perm = acle->perm;
     // The record's mechanism is a 17-byte field; one without its NUL is
     // taken as its first 16 characters rather than read past.
-    parts->mech = has_mech(acle->type) ? acle->mech : "";
-    parts->mechlen = has_mech(acle->type) ? strnlen(acle->mech, kMechMax) : 0;
-    // A record of a type with an identifier but none given is taken as an
-    // empty identifier; the types without one drop any they carry.
-    parts->id = has_id(acle->type) && acle->id ? acle->id : "";
-    parts->idlen = std::strlen(parts->id);
+    const size_t mechlen = has_mech(acle->type) ? strnlen(acle->mech, kMechMax) : 0;
+    const size_t idlen = has_id(acle->type) && acle->id ? std::strlen(acle->id) : 0;
+    acl__entry_parts_known(*acle, mechlen, idlen, parts);
     return acl__valid_type(acle->type);
 }
 
+// A record of a type with an identifier but none given is taken as an
+// empty identifier; the types without one drop any they carry.
 void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts) {
     *parts = acl__entry_parts{};
     parts->type = acle.type;
@@ -702,10 +700,6 @@ void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t id
     parts->mechlen = has_mech(acle.type) ? mechlen : 0;
     parts->id = has_id(acle.type) && acle.id ? acle.id : "";
     parts->idlen = has_id(acle.type) && acle.id ? idlen : 0;
-}
-
-int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts) {
-    return insert(single, new_entry(parts), node);
 }
 
 int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,

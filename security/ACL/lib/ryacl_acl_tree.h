@@ -144,11 +144,10 @@ void acl__tree_prefetch(const sec_acltree_s *tree, uint32_t idhash);
 bool acl__entry_parts_of(const sec_acle_desc *acle, acl__entry_parts *parts);
 // The same for a record the parser made, whose lengths it gave.
 void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t idlen, acl__entry_parts *parts);
-// acl__tree_insert with the entry as parts.
-int32_t acl__tree_insert_parts(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts);
-// The same for a tree that acl__tree_holds has just said is the entry's
-// (or null: a new one), its small blocks taken from `pool` (null: the
-// heap).  A tree with pooled blocks must be freed before the pool.
+// acl__tree_insert with the entry as parts, for a tree that
+// acl__tree_holds has just said is the entry's (or null: a new one), its
+// small blocks taken from `pool` (null: the heap).  A tree with pooled
+// blocks must be freed before the pool.
 int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
                               acl__pool *pool);
 // Whether the tree is that of sub-ACL (type, mechanism): the key it was

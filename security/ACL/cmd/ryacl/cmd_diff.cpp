@@ -169,10 +169,7 @@ int run_diff(int argc, char **argv) {
                 return RYACL_EXIT_TROUBLE;
             }
             break;
-        default:
-            std::fprintf(stderr, "ryacl diff: unknown option '%s'\n%s",
-                         zo::escape_controls(argv[optind - 1]).c_str(), kUsage);
-            return RYACL_EXIT_TROUBLE;
+        default: return ryacl_util::unknown_option("diff", argv[optind - 1], kUsage);
         }
     }
     if (argc - optind != 2) {

@@ -26,6 +26,7 @@
 #include "acl_load.h"
 #include "ry_zo_int.h"
 #include "ryacl_cmd.h"
+#include "ryacl_cmd_util.h"
 
 namespace {
 
@@ -407,8 +408,7 @@ int run_edit(int argc, char **argv) {
             cache = false;
             continue;
         }
-        std::fprintf(stderr, "ryacl edit: unknown option '%s'\n%s", shown(argv[optind - 1]).c_str(), kUsage);
-        return RYACL_EXIT_TROUBLE;
+        return ryacl_util::unknown_option("edit", argv[optind - 1], kUsage);
     }
     if (argc - optind != 1 || !*argv[optind]) {
         std::fputs(kUsage, stderr);

@@ -99,6 +99,11 @@ int usage_error(const char *what, const char *usage) {
     return RYACL_EXIT_TROUBLE;
 }
 
+int unknown_option(const char *command, const char *arg, const char *usage) {
+    std::fprintf(stderr, "ryacl %s: unknown option '%s'\n%s", command, zo::escape_controls(arg).c_str(), usage);
+    return RYACL_EXIT_TROUBLE;
+}
+
 int finish(int status) {
     if (std::fflush(stdout) != 0 || std::ferror(stdout)) {
         std::perror("ryacl: standard output");

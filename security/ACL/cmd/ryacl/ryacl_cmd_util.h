@@ -20,6 +20,9 @@ std::string file_uri(std::string_view path);
 
 // "ryacl: WHAT" and the usage text on standard error; the usage status.
 int usage_error(const char *what, const char *usage);
+// "ryacl COMMAND: unknown option 'ARG'" (ARG's control characters
+// escaped), then the usage, on standard error; returns RYACL_EXIT_TROUBLE.
+int unknown_option(const char *command, const char *arg, const char *usage);
 // Flush standard output: a failed write is trouble, not success.
 int finish(int status);
 
