@@ -73,6 +73,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     acl model;  // sub-ACLs in order of first appearance
     std::map<std::pair<int, std::string>, size_t> sub_of;            // (type, folded mech)
     std::map<std::tuple<int, std::string, std::string>, bool> seen;  // identities accepted
+    bool clean = true;  // no faulty line, no duplicate
 
     for (;;) {
         sec_acle_desc e;
@@ -91,6 +92,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
             const int32_t msg = current_msgnum();
             FUZZ_CHECK((rc == ACL_RC_FILE_ERROR && msg == 145) || (rc == ACL_RC_PERMISSION && msg == 166) ||
                        (rc == ACL_RC_BAD_ACL && (msg == 165 || msg == 132 || msg == 158 || msg == 159 || msg == 131)));
+            clean = false;
             continue;
         }
         if (e.type == 0) continue;
@@ -103,6 +105,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         if (seen.count(key)) {
             const int32_t msg = current_msgnum();
             FUZZ_CHECK(add == ACL_RC_BAD_ACLE && (msg == 160 || msg == 144 || msg == 161));
+            clean = false;
             continue;
         }
         FUZZ_CHECK(add == 0);
@@ -140,6 +143,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         acl__free_trees(&batched);
         FUZZ_CHECK(same_bytes(second, expected));
         std::free(second.value);
+
+        // With duplicates left to the ordered visit and no going past a
+        // fault: a clean text compiles the same bytes; any other stops the
+        // parse or fails the compilation with a duplicate's report.
+        again.assign(orig.begin(), orig.end());
+        o.keep_going = false;
+        acl__trees_s deferred;
+        deferred.defer_duplicates = true;
+        const int32_t stopped = acl__parse_acltext(again.data(), again.size() - 1, o, sink, &deferred, &res);
+        sec_acl_buffer_desc third{0, nullptr};
+        const int32_t made = stopped ? -1 : sec__acltrees_to_acl(&deferred, &third);
+        if (made > 0) FUZZ_CHECK(made == ACL_RC_BAD_ACLE && (current_msgnum() == 144 || current_msgnum() == 161));
+        acl__free_trees(&deferred);
+        FUZZ_CHECK(clean == (made == 0));
+        if (made == 0) FUZZ_CHECK(same_bytes(third, expected));
+        std::free(third.value);
     }
     FUZZ_CHECK(sec_convert_acl_to_host(1, &compiled) == 0);
 

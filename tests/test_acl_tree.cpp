@@ -163,3 +163,89 @@ TEST(AclTree, SortedEntriesOnASmallStack) {
 }
 
 }  // namespace
+
+namespace {
+
+// Trees of an ACL whose duplicates are left to the ordered visit, filled
+// with user entries of the given identifiers: the add that failed (or 0)
+// and the compiled ACL's result.
+struct deferred_run {
+    int32_t add_rc = 0, compile_rc = 0, compile_msg = 0;
+    bytes compiled;
+};
+deferred_run run_deferred(const std::vector<std::string> &ids, bool defer) {
+    acl__trees_s trees;
+    trees.defer_duplicates = defer;
+    deferred_run r;
+    for (const std::string &id : ids) {
+        sec_acle_desc e = entry(U, 1, "unix", id.c_str());
+        if ((r.add_rc = sec__add_acle_to_trees(&e, &trees)) != 0) break;
+    }
+    if (r.add_rc == 0) {
+        sec_acl_buffer_desc acl{0, nullptr};
+        r.compile_rc = sec__acltrees_to_acl(&trees, &acl);
+        r.compile_msg = r.compile_rc ? rytest::error_msgnum() : 0;
+        r.compiled.assign(static_cast<unsigned char *>(acl.value), static_cast<unsigned char *>(acl.value) + acl.length);
+        std::free(acl.value);
+    }
+    acl__free_trees(&trees);
+    return r;
+}
+
+}  // namespace
+
+// With duplicates deferred, a twin is caught wherever the sort puts it:
+// beside its twin in the sorted tail (in another case, or sharing more
+// than the sort key's twelve bytes), across the merge with an ascending
+// prefix, or at once while identifiers still arrive in one direction.
+// Near twins (one a prefix of the other, or differing only past the key)
+// are no duplicates, and what compiles is what the ordinary trees compile.
+TEST(AclTree, DeferredDuplicatesAreFoundByTheOrderedVisit) {
+    std::vector<std::string> shuffled;
+    for (ent &e : awkward(400, 7)) shuffled.push_back(e.id);
+    std::vector<std::string> ascending = shuffled;
+    std::sort(ascending.begin(), ascending.end(),
+              [](const std::string &a, const std::string &b) { return zo_strcasecmp_posix_1(a.c_str(), b.c_str()) < 0; });
+    const std::string longp = "cn=a.name.longer.than.a.key,ou=";
+    auto upper = [](std::string s) {
+        for (char &c : s) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+        return s;
+    };
+    auto with = [](std::vector<std::string> v, size_t at, const std::string &id) {
+        v.insert(v.begin() + static_cast<long>(at), id);
+        return v;
+    };
+    std::vector<std::string> tailed = ascending;  // 300 ascending, then 100 that are not
+    std::reverse(tailed.begin() + 300, tailed.end());
+    std::vector<std::string> near;
+    for (int k = 0; k < 40; ++k) near.push_back(longp + std::to_string(k * 7919 % 1000));
+    near.push_back("abcdefghijkl");
+    near.push_back("abcdefghijklm");
+    near.push_back("ABCDEFGHIJK");
+
+    struct {
+        std::vector<std::string> ids;
+        int32_t add_rc, compile_rc;
+    } cases[] = {
+        {with(shuffled, 350, upper(shuffled[20])), 0, ACL_RC_BAD_ACLE},        // in the tail, other case
+        {with(tailed, 390, ascending[10]), 0, ACL_RC_BAD_ACLE},                // tail against the prefix
+        {with(near, 41, upper(near[3])), 0, ACL_RC_BAD_ACLE},                  // past the key's bytes
+        {with(ascending, 200, ascending[199]), ACL_RC_BAD_ACLE, 0},            // an ascending run
+        {with({ascending.rbegin(), ascending.rend()}, 5, ascending[395]), ACL_RC_BAD_ACLE, 0},  // descending
+        {shuffled, 0, 0},
+        {tailed, 0, 0},
+        {near, 0, 0},
+        {{near.begin(), near.begin() + 12}, 0, 0},  // sorted by comparison: keys stay alike
+    };
+    for (const auto &c : cases) {
+        const deferred_run got = run_deferred(c.ids, true);
+        EXPECT_EQ(got.add_rc, c.add_rc);
+        EXPECT_EQ(got.compile_rc, c.compile_rc);
+        if (c.add_rc || c.compile_rc) {
+            EXPECT_EQ(rytest::error_msgnum(), 144);
+            continue;
+        }
+        EXPECT_EQ(got.compiled, run_deferred(c.ids, false).compiled);
+        EXPECT_FALSE(got.compiled.empty());
+    }
+}

@@ -65,6 +65,11 @@ struct sec_acltree_s {
         // again.  An entry from anywhere else ends it (unborrow).
         bool borrowed;
         bool ents_pooled;  // ents is a block of the trees' pool
+        // Duplicates deferred (acl__trees_s::defer_duplicates): an entry
+        // out of order is appended unlooked-at and without its hash, and no
+        // index is ever built; the ordered visit finds a duplicate beside
+        // its twin.  User and group trees only: they are the sorted ones.
+        bool defer_dups;
     };
 
     // Null while the tree holds only the entry it was created with; then
@@ -176,6 +181,8 @@ acl__tree_entry_view make_view(const tree *t, const tview &v, const ent &e) {
 }
 
 
+int32_t twin(tree *t, const ent &e);
+
 // Call f(index) for each present entry in order; f returns false to stop.
 template <class F>
 int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
@@ -220,6 +227,11 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
     // first, its text (both ends: one in two crosses a cache line) once
     // the entry has arrived.
     constexpr size_t kAhead = 32;
+    // Where duplicates were deferred, a twin is met right beside: in the
+    // merge, or next in the sorted tail, whose keys differ unless their
+    // texts may be equal (the sort leaves equal texts with equal keys).
+    const bool verify = t->big->defer_dups;
+    const ent *twin_of = nullptr;
     uint32_t i = 0;
     size_t j = 0;
     for (;;) {
@@ -232,19 +244,27 @@ int32_t for_each_in_order(tree *t, const char *fname, F &&f) {
         while (i < sorted_upto && !(v.ents[i].flags & kPresent)) ++i;
         bool have_p = i < sorted_upto, have_t = j < tail;
         if (!have_p && !have_t) break;
-        uint32_t next;
+        bool take_p = have_p;
         if (have_p && have_t) {
             const ent &ep = v.ents[i], &et = v.ents[keys[j].i];
-            next = zo::casecmp_len(v.arena + ep.id_off, ep.id_len, v.arena + et.id_off, et.id_len) <= 0
-                       ? i++
-                       : keys[j++].i;
-        } else {
-            next = have_p ? i++ : keys[j++].i;
+            const int c = zo::casecmp_len(v.arena + ep.id_off, ep.id_len, v.arena + et.id_off, et.id_len);
+            if (c == 0 && verify) {
+                twin_of = &et;  // the tail comes after the whole prefix
+                break;
+            }
+            take_p = c <= 0;
         }
-        if (!f(next)) break;
+        if (!take_p && verify && j > 0 && keys[j].k == keys[j - 1].k && keys[j].k2 == keys[j - 1].k2) {
+            const ent &x = v.ents[keys[j - 1].i], &y = v.ents[keys[j].i];
+            if (zo::casecmp_len(v.arena + x.id_off, x.id_len, v.arena + y.id_off, y.id_len) == 0) {
+                twin_of = &y;  // equal texts sort in entry order
+                break;
+            }
+        }
+        if (!f(take_p ? i++ : keys[j++].i)) break;
     }
     std::free(keys);
-    return 0;
+    return twin_of ? twin(t, *twin_of) : 0;
 }
 
 // ---- Growing --------------------------------------------------------------------
@@ -380,7 +400,8 @@ bool grow_ents(big_part *b, size_t need, acl__pool *pool, size_t *failed) {
 // entries and `bytes` further arena bytes; one whose entry came from `text`
 // borrows that text as its arena.  The block is reallocated, so the link to
 // the tree is updated.
-int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullptr, acl__pool *pool = nullptr) {
+int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullptr, acl__pool *pool = nullptr,
+                bool defer = false) {
     static_assert(sizeof(tree) % alignof(big_part) == 0, "big_part follows the header");
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
@@ -427,6 +448,7 @@ int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullp
     nb.sorted_upto = 1;
     nb.descending = true;
     nb.last_key = key0;
+    nb.defer_dups = defer && sorted_type(nt->type);
     nt->big = reinterpret_cast<big_part *>(base);
     std::memcpy(static_cast<void *>(nt->big), &nb, sizeof nb);
     *node = nt;
@@ -504,6 +526,21 @@ int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
     return 0;
 }
 
+// The duplicate record of e, the later of two equal identifiers found by
+// an ordered visit.
+int32_t twin(tree *t, const ent &e) {
+    const tview v = view_of(t);
+    acl__entry_parts parts;
+    parts.type = t->type;
+    parts.perm = e.perm;
+    parts.mech = entry_mech(t, v, e);
+    parts.id = v.arena + e.id_off;
+    parts.idlen = e.id_len;
+    new_entry ne(parts);
+    ent copy = e;
+    return duplicate(1, ne, copy);
+}
+
 // Create a one-entry tree.
 int32_t create(const new_entry &ne, tree **node, acl__pool *pool) {
     const size_t mechlen = has_mech(ne.type) ? ne.mechlen : 0;
@@ -579,7 +616,8 @@ bool same_spelling(const tree *t, const char *mech) {
 
 // `held`: the caller has checked that the tree is the entry's sub-ACL's.
 // `pool`: the trees' pool, for the tree's small blocks (null: the heap).
-int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held = false, acl__pool *pool = nullptr) {
+int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held = false, acl__pool *pool = nullptr,
+               bool defer = false) {
     const char *fname = "sec__add_acle_to_tree";
     tree *t = *node;
     if (!t) return create(ne, node, pool);
@@ -589,7 +627,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
     if (!t->big) {
         if ((t->e0.flags & kPresent) && (!has_id(t->type) || small_matches(t, ne)))
             return duplicate(single, ne, t->e0);
-        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1, ne.text, pool)) return rc;
+        if (int32_t rc = promote(node, 1, ne.idlen + 1 + ne.mechlen + 1, ne.text, pool, defer)) return rc;
         t = *node;
     }
     big_part *b = t->big;
@@ -604,12 +642,17 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
         if (f < b->n) return duplicate(single, ne, b->ents[f]);
     } else {
         // Once neither direction holds the comparison tells nothing more.
-        if (b->sorted_upto == i || b->descending) {
+        const bool compared = b->sorted_upto == i || b->descending;
+        if (compared) {
             key = order_key(ne.id, ne.idlen);
             last_cmp = against_latest(b, key, ne.id, ne.idlen);
         }
         const bool in_run = (last_cmp < 0 && b->sorted_upto == i) || (last_cmp > 0 && b->descending);
-        if (!b->idx && !in_run) {
+        if (b->defer_dups) {
+            // In a run only the latest entry can be a twin; out of one, the
+            // ordered visit looks.
+            if (compared && last_cmp == 0) return duplicate(single, ne, b->ents[i - 1]);
+        } else if (!b->idx && !in_run) {
             if (i > kScanMax) {
                 if (!grow_index(b, size_t{i} + 1, &failed)) return no_memory(fname, failed);
             } else if (ent *d = scan(b, ne)) {
@@ -652,7 +695,7 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
         p = q;
     }
     b->ents[i] = ent{static_cast<uint32_t>(p - b->arena), static_cast<uint32_t>(ne.idlen), ne.perm,
-                     ne.h() | kPresent | (own ? kOwnMech : 0)};
+                     (b->defer_dups ? 0u : ne.h()) | kPresent | (own ? kOwnMech : 0)};
     b->arena_len += static_cast<uint32_t>(add);
     if (b->idx) {
         if (!found) ++b->idx_used;
@@ -703,8 +746,8 @@ void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t id
 }
 
 int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
-                              acl__pool *pool) {
-    return insert(single, new_entry(parts), node, true, pool);
+                              acl__pool *pool, bool defer) {
+    return insert(single, new_entry(parts), node, true, pool, defer);
 }
 
 bool acl__tree_holds(const sec_acltree_s *t, unsigned char type, const char *mech, size_t mechlen) {

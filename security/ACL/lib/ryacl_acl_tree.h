@@ -39,6 +39,13 @@ struct acl__trees_s {
     // The one text the trees' identifiers may point into (see
     // acl__parse_acltext); it must outlive them.
     const char *text = nullptr;
+    // Set before the first entry, for a caller that will write the trees
+    // out in order and starts over from the beginning on any failure: an
+    // entry that arrives out of order is then not looked up at all, and a
+    // duplicate is found when the sort for the writer puts it beside its
+    // twin (acl__tree_visit fails with the duplicate's 43).  Such trees are
+    // only added to, sized, visited and freed.
+    bool defer_duplicates = false;
 };
 
 // Find or append the tree of the entry's sub-ACL and insert a copy of the
@@ -81,7 +88,8 @@ size_t acl__tree_count(const sec_acltree_s *tree);
 const char *acl__tree_mech(const sec_acltree_s *tree);
 // Visit the present entries in order; stop early when fn returns false.
 // Returns 0, or 6 (message 89 recorded) when ordering needs memory that
-// cannot be had.
+// cannot be had, or, in a tree whose duplicates were deferred, 43 with the
+// duplicate's message at the second of two equal identifiers.
 typedef bool (*acl__tree_visit_fn)(const acl__tree_entry_view *e, void *ctx);
 int32_t acl__tree_visit(sec_acltree_s *tree, acl__tree_visit_fn fn, void *ctx);
 // The same, naming `fname` in message 89.
@@ -147,9 +155,11 @@ void acl__entry_parts_known(const sec_acle_desc &acle, size_t mechlen, size_t id
 // acl__tree_insert with the entry as parts, for a tree that
 // acl__tree_holds has just said is the entry's (or null: a new one), its
 // small blocks taken from `pool` (null: the heap).  A tree with pooled
-// blocks must be freed before the pool.
+// blocks must be freed before the pool.  `defer`: see
+// acl__trees_s::defer_duplicates; a tree keeps the choice made when it
+// grew past its first entry.
 int32_t acl__tree_insert_held(sec_acltree_t *node, sec_boolean_t single, const acl__entry_parts &parts,
-                              acl__pool *pool);
+                              acl__pool *pool, bool defer = false);
 // Whether the tree is that of sub-ACL (type, mechanism): the key it was
 // created with, the mechanism compared case-insensitively.
 bool acl__tree_holds(const sec_acltree_s *tree, unsigned char type, const char *mech, size_t mechlen);

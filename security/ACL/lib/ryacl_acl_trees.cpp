@@ -94,7 +94,9 @@ void acl__trees_prefetch(const acl__trees_s *trees, acl__entry_parts *parts, siz
     constexpr size_t kMax = 64;
     uint32_t keys[kMax];
     if (n > kMax) n = kMax;
-    for (size_t k = 0; k < n; ++k) {
+    // Deferred duplicates need no identifier's hash (a new tree takes its
+    // first one when it is created).
+    for (size_t k = 0; k < n && !(trees && trees->defer_duplicates); ++k) {
         if (acl__type_has_id(parts[k].type)) {
             parts[k].idhash = acl__id_hash(parts[k].id, parts[k].idlen);
             parts[k].hashed = true;
@@ -167,7 +169,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     if (found >= 0) {
         x->last = found;
         x->last_hash = h;
-        return acl__tree_insert_held(&trees->trees[found], 1, ne, &x->pool);
+        return acl__tree_insert_held(&trees->trees[found], 1, ne, &x->pool, trees->defer_duplicates);
     }
 
     // A new sub-ACL: grow the index and the array first, so a failure
@@ -187,7 +189,7 @@ int32_t acl__add_parts_to_trees(const acl__entry_parts &ne, acl__trees_s *trees)
     trees->trees[slot] = nullptr;
     // When the first entry cannot be stored the slot stays, counted and
     // empty, and out of the index.
-    int32_t rc = acl__tree_insert_held(&trees->trees[slot], 1, ne, &x->pool);
+    int32_t rc = acl__tree_insert_held(&trees->trees[slot], 1, ne, &x->pool, trees->defer_duplicates);
     if (rc) return rc;
     index_put(x, slot_value(h, static_cast<uint32_t>(slot)));
     ++x->used;
