@@ -37,7 +37,7 @@ int32_t subacl_size(sec_acltree_s *tree, const char *fname, size_t *size, size_t
     const unsigned char type = acl__tree_type(tree);
     if (max_idlen > ACL_MAX_IDLEN) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
     uint64_t total = ACL_SUBACL_HDR_SIZE;
-    if (acl__type_has_mech(type)) total += std::strlen(acl__tree_mech(tree)) + 1;
+    if (acl__type_has_mech(type)) total += acl__tree_mechlen(tree) + 1;
     total += uint64_t{*count} * ACL_ENTRY_HDR_SIZE;
     if (acl__type_has_id(type)) total += id_bytes + *count;
     if (total > INT32_MAX) return acl__no_memory(fname, INT32_MAX);
@@ -94,7 +94,7 @@ bool write_entry(const acl__tree_entry_view *e, void *ctx) {
 int32_t write_subacl(sec_acltree_s *tree, writer *w, size_t size, size_t count, const char *fname) {
     const unsigned char type = acl__tree_type(tree);
     const char *mech = acl__type_has_mech(type) ? acl__tree_mech(tree) : "";
-    const size_t mechfield = acl__type_has_mech(type) ? std::strlen(mech) + 1 : 0;
+    const size_t mechfield = acl__type_has_mech(type) ? acl__tree_mechlen(tree) + 1 : 0;
     const uint64_t start = w->written;
     if (unsigned char *dst = w->take(ACL_SUBACL_HDR_SIZE + mechfield)) {
         acl__store_le32(dst, static_cast<uint32_t>(size));

@@ -918,6 +918,8 @@ const char *acl__tree_mech(const sec_acltree_s *ct) {
     return entry_mech(t, v, v.ents[f]);
 }
 
+size_t acl__tree_mechlen(const sec_acltree_s *t) { return t ? t->mechlen : 0; }
+
 int32_t acl__tree_visit_named(sec_acltree_s *t, acl__tree_visit_fn fn, void *ctx, const char *fname) {
     if (!t || !fn) return 0;
     tview v = view_of(t);

@@ -86,6 +86,9 @@ size_t acl__tree_count(const sec_acltree_s *tree);
 // Mechanism text the sub-ACL carries: that of the earliest inserted entry
 // still present ("" when none).
 const char *acl__tree_mech(const sec_acltree_s *tree);
+// Its length, read from the tree's header alone (every spelling of one
+// mechanism has the same length).
+size_t acl__tree_mechlen(const sec_acltree_s *tree);
 // Visit the present entries in order; stop early when fn returns false.
 // Returns 0, or 6 (message 89 recorded) when ordering needs memory that
 // cannot be had, or, in a tree whose duplicates were deferred, 43 with the
