@@ -90,7 +90,7 @@ struct reader {
     }
 };
 
-// Step 8: whether the cache file is to be tried.
+// Whether the cache file is to be tried.
 bool reader::choose_cache() {
     if (flags & SEC_ACLF_FROM_TEXT) {
         tr::point(tr::INFO, 116, {tr::str(aclfname)});
@@ -116,7 +116,7 @@ bool reader::choose_cache() {
     return true;
 }
 
-// Step 9 for the cache file: true when the compiled ACL was handed over.
+// Take the compiled ACL from the cache file: true when it was handed over.
 bool reader::take_cache() {
     acl__file_step("read:open", caclfname);
     int fd = open(caclfname, O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
@@ -160,7 +160,7 @@ bool reader::take_cache() {
     return true;
 }
 
-// Steps 10 to 12.
+// The text: read, parsed into trees, compiled and, when asked, cached.
 int32_t reader::parse() {
     flags &= ~static_cast<uint32_t>(SEC_ACLF_CONVERT_CACHE);
     tr::perf_timer timer(1);
