@@ -16,6 +16,7 @@
 #include "ryacl_error.h"
 #include "ryacl_acl_edit.h"
 #include "ryacl_init.h"
+#include "ryacl_trace.h"
 #include "ryacl_utils.h"
 #include "ryacl_utils_codeset.h"
 
@@ -52,8 +53,9 @@ struct acl_file {
 };
 
 // A failed read or check stores nothing; a cache that cannot be read into memory is passed over.
-// ryaclfck -s runs a quiet pass first: a failure there is never shown, the ordinary check (swept
-// under -c -s, which skips the quiet pass) runs instead and stores the cache.
+// ryaclfck -s runs a quiet pass first: a failure there is never shown, the ordinary check runs
+// instead and stores the cache.  The ordinary check is swept with a trace level set, which skips
+// the quiet pass.
 TEST(AllocFailures, ReadingAndCheckingStoreNothingOnFailure) {
     acl_file f;
     rytest::tmp_dir logs;
@@ -61,15 +63,18 @@ TEST(AllocFailures, ReadingAndCheckingStoreNothingOnFailure) {
     dup2(log, 2);
     sec_buffer_desc acl{0, nullptr};
     enum { READ, CHECK, QUIET, FROM_CACHE };
-    const char *name[] = {"sec_read_acl_file (text, cache write)", "ryaclfck -c -s", "ryaclfck -s",
+    const char *name[] = {"sec_read_acl_file (text, cache write)", "ryaclfck -s (traced: the ordinary check)", "ryaclfck -s",
                           "sec_read_acl_file (cache, convert)"};
+    ASSERT_EQ(setenv("RYACL_TRACE_FILE", "/dev/null", 1), 0);
+    acl::trace::level(acl::trace::PERF);  // registered now, so the level set below stays
     for (int road : {READ, CHECK, QUIET, FROM_CACHE}) {
+        acl__trace_detail_levels[acl::trace::PERF] = road == CHECK ? 1 : 0;
         const uint32_t flags = road == READ ? SEC_ACLF_WRITE_CACHE : SEC_ACLF_CONVERT_CACHE;
         uint32_t rflags = 0;
         long fallbacks = 0;
         auto run = [&] {
             if (road == CHECK || road == QUIET)
-                return aclfck__bulk_aclfile(f.path.c_str(), nullptr, ACLFCK_CACHE | (road == CHECK ? ACLFCK_CONTINUE : 0));
+                return aclfck__bulk_aclfile(f.path.c_str(), nullptr, ACLFCK_CACHE);
             return sec_read_acl_file(f.path.c_str(), nullptr, nullptr, flags, &acl, &rflags);
         };
         const long n = sweep(name[road], run, [&](int32_t rc, long nth) {
@@ -98,6 +103,7 @@ TEST(AllocFailures, ReadingAndCheckingStoreNothingOnFailure) {
                                        : n > 3 && (road == CHECK || road == QUIET || rflags & SEC_ACLF_WRITE_CACHE))
             << name[road];
     }
+    acl__trace_detail_levels[acl::trace::PERF] = 0;
     dup2(saved, 2), close(saved), close(log);
     sec_release_acl(&acl);
 }

@@ -102,20 +102,22 @@ int32_t aclfck__get_aclfile(const char *aclfname, const char *username, char *na
 
 int32_t aclfck__stream_aclfile(const char *, const char *, uint32_t) { return 0; }
 
-// A check that is to store the cache and shows nothing on the way runs
+// A check that is to store the cache and shows no entry on the way runs
 // quietly first, with duplicates found by the sort that writes the cache
 // instead of a lookup per entry (a shuffled file spends a fifth of its
-// time on those).  Whatever that pass meets (a fault, a duplicate, a cache
-// that cannot be written) sends the file through the ordinary check from
-// the start, which reports exactly what it reports alone: the faulty file
-// is read twice, and the output is never the quiet pass's.  A trace would
-// show both passes, so a traced check runs the ordinary one only.
+// time on those), and stopping at the first fault.  On a clean file that
+// is all the ordinary check would do, with or without -c.  Whatever that
+// pass meets (a fault, a duplicate, a cache that cannot be written) sends
+// the file through the ordinary check from the start, which reports
+// exactly what it reports alone: the faulty file is read twice, and the
+// output is never the quiet pass's.  A trace would show both passes, so a
+// traced check runs the ordinary one only.
 int32_t aclfck__check(const char *aclfname, const char *username, uint32_t flags, acl__text_sink &sink,
                       acl__parse_result *res) {
-    if ((flags & ACLFCK_CACHE) && !(flags & (ACLFCK_CONTINUE | ACLFCK_VERBOSE)) && !tracing()) {
+    if ((flags & ACLFCK_CACHE) && !(flags & ACLFCK_VERBOSE) && !tracing()) {
         quiet_sink quiet;
         acl__parse_result quiet_res;
-        if (check_pass(aclfname, username, flags, quiet, &quiet_res, true) == 0 && !quiet.met) {
+        if (check_pass(aclfname, username, flags & ~ACLFCK_CONTINUE, quiet, &quiet_res, true) == 0 && !quiet.met) {
             if (res) *res = quiet_res;
             return 0;
         }
