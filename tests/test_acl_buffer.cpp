@@ -98,6 +98,8 @@ TEST(AclBuffer, LimitsAreRefusedNotWrapped) {
     EXPECT_EQ(get(compile(trees), 5 + 15, 2), 65535u);  // the identifier's length field, NUL included
     ASSERT_EQ(sec__add_acle_to_trees(&b, &trees), 0);  // one byte more
     EXPECT_EQ(compile(trees, {ACL_RC_BAD_ACLE, 95}), bytes{});
+    ASSERT_EQ(sec__del_acle_from_tree(&b, trees.trees[0]), 0);  // and compiles again without it
+    EXPECT_EQ(get(compile(trees), 5 + 15, 2), 65535u);
     acl__free_trees(&trees);
 
     // 65535 sub-ACLs fill the 16-bit count; one more is refused as over

@@ -30,12 +30,12 @@ int32_t size_arg(size_t n) { return n > INT32_MAX ? INT32_MAX : static_cast<int3
 //    layout cannot express (the size shown is capped at INT32_MAX).
 int32_t subacl_size(sec_acltree_s *tree, const char *fname, size_t *size, size_t *count) {
     uint64_t id_bytes = 0;
-    size_t max_idlen = 0;
-    acl__tree_stats(tree, count, &id_bytes, &max_idlen);
+    bool too_long_id = false;
+    acl__tree_stats(tree, count, &id_bytes, &too_long_id);
     *size = 0;
     if (*count == 0) return 0;
     const unsigned char type = acl__tree_type(tree);
-    if (max_idlen > ACL_MAX_IDLEN) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
+    if (too_long_id) return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::ACLE_LACKS_MECH_OR_ID);
     uint64_t total = ACL_SUBACL_HDR_SIZE;
     if (acl__type_has_mech(type)) total += acl__tree_mechlen(tree) + 1;
     total += uint64_t{*count} * ACL_ENTRY_HDR_SIZE;

@@ -54,10 +54,6 @@ struct acl__line_fault {
     const char *token = nullptr;
     size_t length = 0;  // the line's bytes with its terminator
 };
-// sec__read_acle_from_text that records nothing: a faulty line's report
-// goes to *fault and its code is returned.  The thread's error may have
-// been changed on the way (a permission letter's message) and is not the
-// line's until acl__record_line_fault is called.
 // What a caller parsing many lines passes in and gets back besides the
 // entry: the byte classes acl__line_classes returned on this thread since
 // its locale last changed (looked up once, not once per line), and the
@@ -68,6 +64,10 @@ struct acl__line_ctx {
     size_t mechlen = 0;
     size_t idlen = 0;
 };
+// sec__read_acle_from_text that records nothing: a faulty line's report
+// goes to *fault and its code is returned.  The thread's error may have
+// been changed on the way (a permission letter's message) and is not the
+// line's until acl__record_line_fault is called.
 int32_t acl__read_acle_deferred(const sec_perm_set_desc *permset, char **tacl, size_t *length, int32_t *lineno,
                                 sec_acle_t acle, acl__line_fault *fault, acl__line_ctx *ctx = nullptr);
 // The byte classes of the calling thread's locale that the parser uses.

@@ -29,6 +29,7 @@
 #include <cstring>
 
 #include "ry_zo_int.h"
+#include "ryacl_acl_cursor.h"
 #include "ryacl_acl_entry.h"
 #include "ryacl_alloc.h"
 #include "ryacl_acl_sort.h"
@@ -57,8 +58,12 @@ struct sec_acltree_s {
         uint32_t n_present;
         uint32_t sorted_upto;  // entries [0, sorted_upto) ascend strictly
         uint32_t first_live;   // no present entry before it; only moves forward
-        bool descending;       // every entry so far descends strictly
+        // The present entries' identifier bytes (they lie in an arena or a
+        // text of under 4 GiB), and how many of them are longer than a
+        // compiled ACL can hold: a sub-ACL is sized without a walk.
+        uint32_t id_bytes;
         uint64_t last_key;     // order_key of the latest entry's identifier
+        bool descending;       // every entry so far descends strictly
         // The arena is the text the entries were parsed from, which the
         // tree does not own (arena_len and arena_cap are then 0): a
         // million identifiers are not copied and their pages not touched
@@ -70,6 +75,7 @@ struct sec_acltree_s {
         // index is ever built; the ordered visit finds a duplicate beside
         // its twin.  User and group trees only: they are the sorted ones.
         bool defer_dups;
+        uint32_t n_long;
     };
 
     // Null while the tree holds only the entry it was created with; then
@@ -164,10 +170,16 @@ uint32_t first_present(tree *t) {
     return b->first_live;
 }
 
+bool too_long(uint32_t idlen) { return idlen > ACL_MAX_IDLEN; }
+
 void mark_removed(tree *t, ent &e) {
     if (!(e.flags & kPresent)) return;
     e.flags &= ~kPresent;
-    if (t->big) --t->big->n_present;
+    if (big_part *b = t->big) {
+        --b->n_present;
+        b->id_bytes -= e.id_len;
+        b->n_long -= too_long(e.id_len);
+    }
 }
 
 acl__tree_entry_view make_view(const tree *t, const tview &v, const ent &e) {
@@ -445,6 +457,8 @@ int32_t promote(tree **node, size_t more, size_t bytes, const char *text = nullp
     if (nb.borrowed) nb.ents[0].id_off = nt->e0_text_off;
     nb.n = 1;
     nb.n_present = (nt->e0.flags & kPresent) ? 1 : 0;
+    nb.id_bytes = nb.n_present ? nt->e0.id_len : 0;
+    nb.n_long = nb.n_present && too_long(nt->e0.id_len);
     nb.sorted_upto = 1;
     nb.descending = true;
     nb.last_key = key0;
@@ -508,16 +522,19 @@ struct new_entry : acl__entry_parts {
     }
 };
 
-int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
-    char letter = acl__type_letter(ne.type);
-    if (single) {
-        switch (ne.type) {
-        case SEC_ACLE_TYPE_UNAUTHENTICATED:
-        case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_SINGLE_ACLE, letter);
-        case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_GROUP, letter, ne.id);
-        default: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_ACLE, letter, ne.mech, ne.id);
-        }
+// The refusal of an entry whose identity is already there.
+int32_t refuse_duplicate(const acl__entry_parts &ne) {
+    const char letter = acl__type_letter(ne.type);
+    switch (ne.type) {
+    case SEC_ACLE_TYPE_UNAUTHENTICATED:
+    case SEC_ACLE_TYPE_ANYOTHER: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_SINGLE_ACLE, letter);
+    case SEC_ACLE_TYPE_GROUP: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_GROUP, letter, ne.id);
+    default: return acl::set_error(ACL_RC_BAD_ACLE, acl::msg::DUPLICATE_ACLE, letter, ne.mech, ne.id);
     }
+}
+
+int32_t duplicate(sec_boolean_t single, const new_entry &ne, ent &stored) {
+    if (single) return refuse_duplicate(ne);
     stored.perm = ne.perm;
     using namespace acl::trace;
     const char *mech = (has_mech(ne.type) || ne.type == SEC_ACLE_TYPE_GROUP) ? ne.mech : "<none>";
@@ -532,13 +549,9 @@ int32_t twin(tree *t, const ent &e) {
     const tview v = view_of(t);
     acl__entry_parts parts;
     parts.type = t->type;
-    parts.perm = e.perm;
     parts.mech = entry_mech(t, v, e);
     parts.id = v.arena + e.id_off;
-    parts.idlen = e.id_len;
-    new_entry ne(parts);
-    ent copy = e;
-    return duplicate(1, ne, copy);
+    return refuse_duplicate(parts);
 }
 
 // Create a one-entry tree.
@@ -708,6 +721,8 @@ int32_t insert(sec_boolean_t single, const new_entry &ne, tree **node, bool held
     }
     b->n = i + 1;
     ++b->n_present;
+    b->id_bytes += static_cast<uint32_t>(ne.idlen);
+    b->n_long += too_long(static_cast<uint32_t>(ne.idlen));
     return 0;
 }
 
@@ -959,17 +974,18 @@ int32_t acl__tree_visit(sec_acltree_s *t, acl__tree_visit_fn fn, void *ctx) {
     return acl__tree_visit_named(t, fn, ctx, "acl__tree_visit");
 }
 
-void acl__tree_stats(const sec_acltree_s *ct, size_t *count, uint64_t *id_bytes, size_t *max_idlen) {
+void acl__tree_stats(const sec_acltree_s *t, size_t *count, uint64_t *id_bytes, bool *too_long_id) {
     *count = 0;
     *id_bytes = 0;
-    *max_idlen = 0;
-    if (!ct) return;
-    tview v = view_of(const_cast<tree *>(ct));
-    for (uint32_t i = 0; i < v.n; ++i) {
-        const ent &e = v.ents[i];
-        if (!(e.flags & kPresent)) continue;
-        ++*count;
-        *id_bytes += e.id_len;
-        if (e.id_len > *max_idlen) *max_idlen = e.id_len;
+    *too_long_id = false;
+    if (!t) return;
+    if (const big_part *b = t->big) {
+        *count = b->n_present;
+        *id_bytes = b->id_bytes;
+        *too_long_id = b->n_long != 0;
+    } else if (t->e0.flags & kPresent) {
+        *count = 1;
+        *id_bytes = t->e0.id_len;
+        *too_long_id = too_long(t->e0.id_len);
     }
 }

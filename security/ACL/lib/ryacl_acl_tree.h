@@ -114,9 +114,10 @@ int32_t acl__tree_insert(sec_acltree_t *node, sec_boolean_t single, unsigned cha
 // so that a tree whose size is known grows once.  0, or 6 (message 89).
 // The tree may move: *tree is updated.
 int32_t acl__tree_reserve(sec_acltree_t *tree, size_t entries, size_t bytes);
-// Without ordering anything: the number of present entries, the sum of
-// their identifier lengths and the longest one.
-void acl__tree_stats(const sec_acltree_s *tree, size_t *count, uint64_t *id_bytes, size_t *max_idlen);
+// Without ordering or walking anything: the number of present entries,
+// the sum of their identifier lengths, and whether any is longer than a
+// compiled ACL can hold.
+void acl__tree_stats(const sec_acltree_s *tree, size_t *count, uint64_t *id_bytes, bool *too_long_id);
 
 // ---- Shared by the tree and the array of trees ---------------------------
 

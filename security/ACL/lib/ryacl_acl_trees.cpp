@@ -96,12 +96,12 @@ void acl__trees_prefetch(const acl__trees_s *trees, acl__entry_parts *parts, siz
     if (n > kMax) n = kMax;
     // Deferred duplicates need no identifier's hash (a new tree takes its
     // first one when it is created).
-    for (size_t k = 0; k < n && !(trees && trees->defer_duplicates); ++k) {
-        if (acl__type_has_id(parts[k].type)) {
-            parts[k].idhash = acl__id_hash(parts[k].id, parts[k].idlen);
-            parts[k].hashed = true;
-        }
-    }
+    if (!(trees && trees->defer_duplicates))
+        for (size_t k = 0; k < n; ++k)
+            if (acl__type_has_id(parts[k].type)) {
+                parts[k].idhash = acl__id_hash(parts[k].id, parts[k].idlen);
+                parts[k].hashed = true;
+            }
     const auto *x = trees ? static_cast<const trees_index *>(trees->index) : nullptr;
     if (!x || !x->slots) return;
     // Each step reads what the step before fetched, for the whole batch at

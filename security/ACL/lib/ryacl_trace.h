@@ -34,6 +34,13 @@ inline tr_detail_level_t level(category c) {
     return acl__trace_detail_levels[c];
 }
 
+// Whether any category records anything.
+inline bool any_on() {
+    for (auto c : {ERRORS, INFO, API, BUFFER, PERF})
+        if (level(c)) return true;
+    return false;
+}
+
 // One data item: an address and a length in bytes.
 struct item {
     const void *p;

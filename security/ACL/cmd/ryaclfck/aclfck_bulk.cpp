@@ -39,12 +39,6 @@ struct quiet_sink final : acl__text_sink {
     void entry(const sec_acle_desc &, int32_t) override {}
 };
 
-bool tracing() {
-    for (auto c : {acl::trace::ERRORS, acl::trace::INFO, acl::trace::API, acl::trace::BUFFER, acl::trace::PERF})
-        if (acl::trace::level(c)) return true;
-    return false;
-}
-
 // One check of the file from the start; `defer`: duplicates are left to
 // the sort that writes the cache (acl__trees_s::defer_duplicates).
 int32_t check_pass(const char *aclfname, const char *username, uint32_t flags, acl__text_sink &sink,
@@ -114,7 +108,7 @@ int32_t aclfck__stream_aclfile(const char *, const char *, uint32_t) { return 0;
 // traced check runs the ordinary one only.
 int32_t aclfck__check(const char *aclfname, const char *username, uint32_t flags, acl__text_sink &sink,
                       acl__parse_result *res) {
-    if ((flags & ACLFCK_CACHE) && !(flags & ACLFCK_VERBOSE) && !tracing()) {
+    if ((flags & ACLFCK_CACHE) && !(flags & ACLFCK_VERBOSE) && !acl::trace::any_on()) {
         quiet_sink quiet;
         acl__parse_result quiet_res;
         if (check_pass(aclfname, username, flags & ~ACLFCK_CONTINUE, quiet, &quiet_res, true) == 0 && !quiet.met) {
